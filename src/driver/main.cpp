@@ -1,0 +1,3 @@
+#include "driver/RKMain.h"
+
+int main(int argc, char** argv) { return RKMain(argc, argv); }

@@ -1,0 +1,73 @@
+#include "platform/RKLinuxPlatform.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <time.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+
+#include "platform/RKLinuxTask.h"
+
+namespace {
+
+// Linux has no kernel-side accounting switch; the setting lives with the running program.
+std::atomic<int32_t> gSelfRegionMemspread{0};
+
+uint64_t nanoseconds(const timespec& ts) {
+    return static_cast<uint64_t>(ts.tv_sec) * 1000000000ull + static_cast<uint64_t>(ts.tv_nsec);
+}
+
+}  // namespace
+
+RKLinuxPlatform::RKLinuxPlatform(std::string procRoot, std::string sysRoot)
+    : procRoot_(std::move(procRoot)), sysRoot_(std::move(sysRoot)) {}
+
+kern_return_t RKLinuxPlatform::taskForPid(pid_t pid, std::unique_ptr<RKTask>& task) {
+    std::string path = procRoot_ + "/" + std::to_string(pid);
+    RKUniqueFd directory(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (!directory.valid()) {
+        return (errno == EACCES || errno == EPERM) ? KERN_PROTECTION_FAILURE : KERN_INVALID_ARGUMENT;
+    }
+    // Opening smaps is the kernel's ptrace-read check: without it nothing can be measured.
+    RKUniqueFd smaps(::openat(directory.get(), "smaps", O_RDONLY | O_CLOEXEC));
+    if (!smaps.valid()) {
+        return (errno == EACCES || errno == EPERM) ? KERN_PROTECTION_FAILURE : KERN_INVALID_ARGUMENT;
+    }
+    task = std::make_unique<RKLinuxTask>(pid, std::move(directory));
+    return KERN_SUCCESS;
+}
+
+int RKLinuxPlatform::readSelfRegionMemspread(int32_t& value) {
+    value = gSelfRegionMemspread.load();
+    return 0;
+}
+
+int RKLinuxPlatform::writeSelfRegionMemspread(int32_t value) {
+    gSelfRegionMemspread.store(value);
+    return 0;
+}
+
+bool RKLinuxPlatform::getTimes(RKClockReadings& readings) {
+    timespec monotonic{}, boottime{}, realtime{};
+    if (clock_gettime(CLOCK_MONOTONIC, &monotonic) != 0) return false;
+    if (clock_gettime(CLOCK_BOOTTIME, &boottime) != 0) return false;
+    if (clock_gettime(CLOCK_REALTIME, &realtime) != 0) return false;
+    readings.absolute = nanoseconds(monotonic);
+    readings.continuous = nanoseconds(boottime);
+    readings.wallSeconds = realtime.tv_sec;
+    readings.wallNanoseconds = realtime.tv_nsec;
+    return true;
+}
+
+RKTimebase RKLinuxPlatform::timebase() { return RKTimebase{1, 1}; }
+
+uint64_t RKLinuxPlatform::kernelPageSize() {
+    static const uint64_t pageSize = static_cast<uint64_t>(::sysconf(_SC_PAGESIZE));
+    return pageSize;
+}
+
+uid_t RKLinuxPlatform::effectiveUserId() { return ::geteuid(); }
+
+pid_t RKLinuxPlatform::ownPid() { return ::getpid(); }

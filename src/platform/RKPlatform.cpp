@@ -1,0 +1,51 @@
+#include "platform/RKPlatform.h"
+
+#include <atomic>
+#include <cstdio>
+#include <mutex>
+
+#include "platform/RKLinuxPlatform.h"
+
+namespace {
+
+std::mutex& currentMutex() {
+    static std::mutex mutex;
+    return mutex;
+}
+
+std::shared_ptr<RKPlatform>& currentSlot() {
+    static std::shared_ptr<RKPlatform> platform;
+    return platform;
+}
+
+}  // namespace
+
+RKPlatform& RKPlatform::current() {
+    std::lock_guard<std::mutex> lock(currentMutex());
+    auto& slot = currentSlot();
+    if (!slot) slot = std::make_shared<RKLinuxPlatform>();
+    return *slot;
+}
+
+std::shared_ptr<RKPlatform> RKPlatform::setCurrent(std::shared_ptr<RKPlatform> platform) {
+    std::lock_guard<std::mutex> lock(currentMutex());
+    auto previous = std::move(currentSlot());
+    currentSlot() = std::move(platform);
+    return previous;
+}
+
+const char* mach_error_string(kern_return_t code) {
+    switch (code) {
+        case KERN_SUCCESS: return "success";
+        case KERN_INVALID_ADDRESS: return "address is not mapped";
+        case KERN_PROTECTION_FAILURE: return "permission denied";
+        case KERN_INVALID_ARGUMENT: return "process is gone";
+        case KERN_FAILURE: return "failure";
+        case MACH_SEND_INVALID_DEST: return "process is gone";
+        default: return "unknown error";
+    }
+}
+
+void mach_error(const char* label, kern_return_t code) {
+    std::fprintf(stderr, "%s: %s\n", label, mach_error_string(code));
+}

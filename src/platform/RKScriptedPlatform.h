@@ -1,0 +1,115 @@
+// A platform that answers exactly what a test scripted, and records what was asked of it, so
+// that every algorithm can be tested on exact kernel answers, including ones Linux never gives
+// (a shared region, purge states, the owned-memory pseudo-region, a timebase of 125/3).
+#pragma once
+
+#include <cerrno>
+#include <map>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "platform/RKPlatform.h"
+
+struct RKScriptedRegion {
+    uint64_t start = 0;
+    uint64_t size = 0;
+    RKRegionSubmapInfo info;
+    uint32_t count = RK_REGION_SUBMAP_INFO_COUNT;
+    int purgeState = VM_PURGABLE_DENY;
+    std::optional<std::string> path;
+    RKRegionBasicInfo basic;  // what a top-level query of this entry answers
+};
+
+struct RKScriptedProcess {
+    RKBsdInfo info;
+    std::optional<std::string> executablePath;
+    uint32_t dirtyFlags = 0;
+    kern_return_t taskResult = KERN_SUCCESS;
+    // Short BSD info: 0 and shortStatus, or this errno.
+    int shortStatusErrno = 0;
+    uint32_t shortStatus = 0;
+    // The walk answers these regions in address order, then walkEnd (KERN_INVALID_ADDRESS is
+    // the normal end; anything else is a failed walk).
+    std::vector<RKScriptedRegion> regions;
+    kern_return_t walkEnd = KERN_INVALID_ADDRESS;
+    // Page dispositions by page address; pages not listed answer 0. pageQueryResult != 0 fails.
+    std::map<uint64_t, uint32_t> dispositions;
+    kern_return_t pageQueryResult = KERN_SUCCESS;
+    int rusageErrno = 0;
+    RKRusageInfo rusage;
+    int ledgerErrno = 0;
+    std::vector<int64_t> ledgerBalances;
+    int ownedErrno = ENOENT;
+    std::vector<RKOwnedVmObjectRecord> owned;
+};
+
+class RKScriptedTask : public RKTask {
+public:
+    explicit RKScriptedTask(pid_t pid) : pid_(pid) {}
+    pid_t pid() const override { return pid_; }
+
+private:
+    pid_t pid_;
+};
+
+class RKScriptedPlatform : public RKPlatform {
+public:
+    // Processes in the order listAllPids answers them.
+    std::vector<RKScriptedProcess> processes;
+    bool listFails = false;
+    uint64_t pageSize = 4096;
+    uid_t euid = 0;
+    pid_t selfPid = 999999;
+    RKClockReadings clocks;
+    bool clocksFail = false;
+    RKTimebase base{1, 1};
+    std::vector<std::string> ledgerNames{"page_table"};
+    int ledgerTemplateErrno = 0;
+    int32_t selfRegionValue = 0;
+    int selfRegionReadErrno = 0;
+    int selfRegionWriteErrno = 0;
+
+    // Adds a process with a BSD record made of the given fields and returns it for further
+    // scripting. The reference stays valid until the next addProcess.
+    RKScriptedProcess& addProcess(pid_t pid, const std::string& comm, pid_t ppid = 1,
+                                  uint32_t flags = PROC_FLAG_LP64);
+    RKScriptedProcess* find(pid_t pid);
+
+    // Every call, in order, as "name pid" or "name" (thread-safe).
+    std::vector<std::string> calls() const;
+    size_t callCount(const std::string& name) const;
+
+    std::optional<std::vector<pid_t>> listAllPids() override;
+    std::optional<RKBsdInfo> bsdInfo(pid_t pid) override;
+    int shortBsdInfoStatus(pid_t pid, uint32_t& status) override;
+    std::optional<std::string> executablePath(pid_t pid) override;
+    uint32_t dirtyFlags(pid_t pid) override;
+    kern_return_t taskForPid(pid_t pid, std::unique_ptr<RKTask>& task) override;
+    kern_return_t regionRecurse(RKTask& task, uint64_t& address, uint64_t& size,
+                                RKRegionSubmapInfo& info, uint32_t& count) override;
+    kern_return_t region(RKTask& task, uint64_t& address, uint64_t& size,
+                         RKRegionBasicInfo& info) override;
+    kern_return_t purgableState(RKTask& task, uint64_t address, int& state) override;
+    std::optional<std::string> regionFileName(RKTask& task, uint64_t address) override;
+    kern_return_t pageRangeQuery(RKTask& task, uint64_t address, uint64_t size,
+                                 uint32_t* dispositions, uint64_t& count) override;
+    int pidRusage(RKTask& task, RKRusageInfo& info) override;
+    int ledgerTemplate(std::vector<std::string>& names) override;
+    int ledgerEntries(RKTask& task, std::vector<int64_t>& balances) override;
+    int ownedVmObjects(RKTask& task, std::vector<RKOwnedVmObjectRecord>& records) override;
+    int readSelfRegionMemspread(int32_t& value) override;
+    int writeSelfRegionMemspread(int32_t value) override;
+    bool getTimes(RKClockReadings& readings) override;
+    RKTimebase timebase() override;
+    uint64_t kernelPageSize() override;
+    uid_t effectiveUserId() override;
+    pid_t ownPid() override;
+
+private:
+    void record(const std::string& name, pid_t pid = -1);
+    const RKScriptedRegion* regionAtOrAbove(pid_t pid, uint64_t address);
+
+    mutable std::mutex mutex_;
+    std::vector<std::string> calls_;
+};

@@ -1,0 +1,26 @@
+# Shared by run.sh and test.sh: install what the build needs, then configure and build.
+
+memspread_packages=(cmake g++ make libbsd-dev libgtest-dev libgmock-dev libbenchmark-dev util-linux python3)
+
+# Installs the packages that are missing. apt-get runs only when something is missing, so a
+# prepared machine builds without network or root.
+install_missing_packages() {
+    local missing=()
+    for package in "${memspread_packages[@]}"; do
+        dpkg-query -W -f='${Status}' "$package" 2>/dev/null | grep -q 'install ok installed' || missing+=("$package")
+    done
+    [ ${#missing[@]} -eq 0 ] && return 0
+    echo "Installing: ${missing[*]}" >&2
+    local sudo=()
+    [ "$(id -u)" -ne 0 ] && sudo=(sudo)
+    "${sudo[@]}" apt-get update -qq
+    DEBIAN_FRONTEND=noninteractive "${sudo[@]}" apt-get install -y -qq "${missing[@]}" >/dev/null
+}
+
+# build_tree DIR [cmake options...]: configures DIR once and builds everything in it.
+build_tree() {
+    local dir=$1
+    shift
+    cmake -S "$memspread_root" -B "$dir" -DCMAKE_BUILD_TYPE=RelWithDebInfo "$@" >/dev/null
+    cmake --build "$dir" -j "$(nproc)"
+}
