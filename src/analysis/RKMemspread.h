@@ -12,6 +12,7 @@
 #include <memory>
 #include <vector>
 
+#include "analysis/RKAnalysisTypes.h"
 #include "model/RKTime.h"
 #include "output/RKOutputFormatter.h"
 #include "process/RKAnalysisSettings.h"
@@ -39,13 +40,41 @@ public:
     // is cancelled (destroyed), which restores SIGINT's default action.
     static std::unique_ptr<RKCancelSource> installCancelHandler(std::function<void()> handler);
 
-    // Gathers every process; true when a cancel cut gathering short.
+    // Gathers every process, highest pid first, on one worker thread per online CPU; true when
+    // a cancel cut gathering short (the lowest-pid process then carries a global error).
     bool gatherData();
+    // The processes by descending pid (the gathering order).
+    static RKProcessList _processesBySortingPidDesc(const RKProcessList& processes);
     void cancel() { earlyExit_.store(true); }
 
     void analyzeData();
     void addOutputFormatter(std::shared_ptr<RKOutputFormatter> formatter);
     void printOutputVerbose(bool verbose, bool summarize);
+    // The verbose region listing, on the formatters that offer it.
+    void printSpanlistLikeOutputForProcesses(const RKProcessList& processes);
+
+    // ---- Steps of the analysis, public so that each can be checked on its own ----
+    void _addProcess(const RKProcess& process);
+    void finalizeObjects();
+    void _buildProcessToMemspreadMap();
+    const RKPidToMemspreadMap& pidToMemspread() const { return pidToMemspread_; }
+    // Null once the sharing groups have been built (the groups then hold the objects).
+    const RKIdentityMaps* identityMaps() const { return identityMaps_.get(); }
+    RKProcessList _notHiddenProcesses() const;
+    // Larger memspread first, then larger pid.
+    RKProcessList _processesBySortingMemspread(const RKProcessList& processes) const;
+    // Breakdown on: the process's own dirty + swapped bytes; off: the whole dirty + swapped
+    // bytes of every distinct object it maps.
+    uint64_t _calculateMemspreadForProcess(const RKProcess& process) const;
+    // The objects as `process` sees them, keyed by full name (by name when summarizing).
+    // `processView`, when given, receives an RKProcessView.
+    static std::shared_ptr<RKCategoryMap> _categoriesForObjects(const RKMemoryObjectList& objects,
+                                                                const RKProcess& process, uint8_t* processView,
+                                                                bool summarize);
+    // Every object reached from a shown process, once and whole.
+    RKCategoryMap _categoriesForAllProcessesShouldSummarize(bool summarize) const;
+    static void _totalForCategories(const RKCategoryMap& categories, RKMemoryTotal* outTotal);
+    RKProcessToGroupsMap _generateProcessToProcessGroups() const;
 
     const RKProcessList& processes() const { return processes_; }
     uint32_t qualityOfService() const { return qualityOfService_; }
@@ -60,5 +89,14 @@ private:
     uint32_t qualityOfService_ = QOS_CLASS_UTILITY;
     std::optional<RKTime> gatherStartTime_;
     std::optional<RKTime> gatherEndTime_;
-    // The analysis state (identity maps, per-process totals) is added with the analysis.
+    // Analysis state: the identity maps live from analyzeData until the groups are built.
+    RKPidToMemspreadMap pidToMemspread_;
+    std::unique_ptr<RKIdentityMaps> identityMaps_;
+
+    struct ReportState;
+    void _printReportedProcess(const std::shared_ptr<RKProcess>& process, const RKProcessToGroupsMap& groups,
+                               bool summarize, ReportState& report);
+    void _printProcessHeader(RKProcess& process, bool hasErrors);
+    void _printProcessGroups(RKProcess& process, const RKProcessGroupList* groups, bool summarize);
+    void _printGroup(RKProcessGroup& group, RKProcess& process, bool summarize);
 };

@@ -26,9 +26,12 @@ public:
     std::chrono::system_clock::time_point date() const;
 
     // ticks × numer / denom, multiplied first; 0 when denom is 0. The platform's timebase is
-    // read once for the whole program, on first use.
+    // read once for the whole program, by whichever thread converts first.
     static uint64_t toNanoseconds(uint64_t ticks);
     static uint64_t convert(uint64_t ticks, const RKTimebase& timebase);
+    // Forgets the timebase so that the next conversion reads it again (tests that install a
+    // platform with another timebase).
+    static void resetTimebase();
 
 private:
     RKTime() = default;

@@ -55,6 +55,15 @@ inline constexpr int VM_PURGABLE_VOLATILE = 1;
 inline constexpr int VM_PURGABLE_EMPTY = 2;
 inline constexpr int VM_PURGABLE_DENY = 3;
 
+// protection / max_protection bits of a region record.
+inline constexpr int32_t VM_PROT_READ = 0x1;
+inline constexpr int32_t VM_PROT_WRITE = 0x2;
+inline constexpr int32_t VM_PROT_EXECUTE = 0x4;
+// inheritance of a region record.
+inline constexpr uint32_t VM_INHERIT_SHARE = 0;
+inline constexpr uint32_t VM_INHERIT_COPY = 1;
+inline constexpr uint32_t VM_INHERIT_NONE = 2;
+
 // The tag of the kernel's owned-memory pseudo-region.
 inline constexpr uint32_t RK_OWNED_MEMORY_TAG = 0xFFFFFFFF;
 

@@ -20,6 +20,7 @@ public:
     std::optional<std::string> executablePath(pid_t pid) override;
     uint32_t dirtyFlags(pid_t pid) override;
     kern_return_t taskForPid(pid_t pid, std::unique_ptr<RKTask>& task) override;
+    bool hasSharedRegion() override;
 
     // Address space (RKLinuxRegions.cpp).
     kern_return_t regionRecurse(RKTask& task, uint64_t& address, uint64_t& size,

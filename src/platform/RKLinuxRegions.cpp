@@ -1,13 +1,73 @@
-#include "platform/RKLinuxPlatform.h"
+// The region walk on Linux: /proc/PID/smaps read once when a walk starts (at address 0) and
+// every later call answered from that snapshot by binary search.
+#include <algorithm>
 
-// Placeholder answers until the smaps walk is read.
-kern_return_t RKLinuxPlatform::regionRecurse(RKTask&, uint64_t&, uint64_t&, RKRegionSubmapInfo&,
-                                             uint32_t&) {
-    return KERN_INVALID_ADDRESS;
+#include "platform/RKLinuxPlatform.h"
+#include "platform/RKLinuxTask.h"
+#include "platform/RKLinuxWalk.h"
+
+namespace {
+
+RKLinuxTask* linuxTask(RKTask& task) { return dynamic_cast<RKLinuxTask*>(&task); }
+
+// The first region ending above `address`, or nullptr.
+const RKLinuxRegion* regionEndingAbove(const RKLinuxWalkSnapshot& snapshot, uint64_t address) {
+    auto it = std::upper_bound(snapshot.regions.begin(), snapshot.regions.end(), address,
+                               [](uint64_t a, const RKLinuxRegion& r) { return a < r.vma.end; });
+    return it == snapshot.regions.end() ? nullptr : &*it;
 }
 
-kern_return_t RKLinuxPlatform::region(RKTask&, uint64_t&, uint64_t&, RKRegionBasicInfo&) {
-    return KERN_INVALID_ADDRESS;
+const RKLinuxRegion* regionContaining(const RKLinuxWalkSnapshot& snapshot, uint64_t address) {
+    const RKLinuxRegion* region = regionEndingAbove(snapshot, address);
+    return region && region->vma.start <= address ? region : nullptr;
+}
+
+// Loads a snapshot when none is held, or always when `fresh` (a walk starting over).
+kern_return_t ensureSnapshot(RKLinuxPlatform& platform, RKLinuxTask& task, bool fresh) {
+    if (task.snapshot && !fresh) return KERN_SUCCESS;
+    RKRecycleWalkSnapshot(std::move(task.snapshot));
+    return RKLoadWalkSnapshot(task, platform.procRoot(), platform.kernelPageSize(), task.snapshot);
+}
+
+}  // namespace
+
+kern_return_t RKLinuxPlatform::regionRecurse(RKTask& task, uint64_t& address, uint64_t& size,
+                                             RKRegionSubmapInfo& info, uint32_t& count) {
+    RKLinuxTask* target = linuxTask(task);
+    if (!target) return KERN_INVALID_ARGUMENT;
+    kern_return_t result = ensureSnapshot(*this, *target, address == 0);
+    if (result != KERN_SUCCESS) return result;
+    const RKLinuxRegion* region = regionEndingAbove(*target->snapshot, address);
+    if (!region) {
+        result = target->snapshot->end;
+        RKRecycleWalkSnapshot(std::move(target->snapshot));  // the walk is over
+        return result;
+    }
+    address = region->vma.start;
+    size = region->vma.end - region->vma.start;
+    info = region->info;
+    count = RK_REGION_SUBMAP_INFO_COUNT;
+    return KERN_SUCCESS;
+}
+
+kern_return_t RKLinuxPlatform::region(RKTask& task, uint64_t& address, uint64_t& size, RKRegionBasicInfo& info) {
+    RKLinuxTask* target = linuxTask(task);
+    if (!target) return KERN_INVALID_ARGUMENT;
+    kern_return_t result = ensureSnapshot(*this, *target, false);
+    if (result != KERN_SUCCESS) return result;
+    const RKLinuxRegion* region = regionEndingAbove(*target->snapshot, address);
+    if (!region) return target->snapshot->end;
+    // Linux has no nested maps: the top-level entry is the VMA itself.
+    address = region->vma.start;
+    size = region->vma.end - region->vma.start;
+    info = RKRegionBasicInfo{};
+    info.protection = region->info.protection;
+    info.max_protection = region->info.max_protection;
+    info.inheritance = region->info.inheritance;
+    info.shared = region->info.share_mode == SM_SHARED ? 1 : 0;
+    info.offset = region->info.offset;
+    info.user_wired_count = region->info.user_wired_count;
+    return KERN_SUCCESS;
 }
 
 kern_return_t RKLinuxPlatform::purgableState(RKTask&, uint64_t, int& state) {
@@ -15,7 +75,13 @@ kern_return_t RKLinuxPlatform::purgableState(RKTask&, uint64_t, int& state) {
     return KERN_SUCCESS;
 }
 
-std::optional<std::string> RKLinuxPlatform::regionFileName(RKTask&, uint64_t) { return std::nullopt; }
+std::optional<std::string> RKLinuxPlatform::regionFileName(RKTask& task, uint64_t address) {
+    RKLinuxTask* target = linuxTask(task);
+    if (!target || ensureSnapshot(*this, *target, false) != KERN_SUCCESS) return std::nullopt;
+    const RKLinuxRegion* region = regionContaining(*target->snapshot, address);
+    if (!region || region->detail.empty()) return std::nullopt;
+    return std::string(region->detail);
+}
 
 kern_return_t RKLinuxPlatform::pageRangeQuery(RKTask&, uint64_t, uint64_t, uint32_t*, uint64_t& count) {
     count = 0;

@@ -2,10 +2,33 @@
 // process goes through openat() below it, so a pid reused by another process is never read.
 #pragma once
 
+#include <memory>
 #include <string>
+#include <string_view>
+#include <vector>
 
+#include "platform/RKLinuxVmaClassifier.h"
 #include "platform/RKPlatform.h"
+#include "platform/RKSmapsParser.h"
 #include "platform/RKUniqueFd.h"
+
+// One VMA of the walk, classified.
+struct RKLinuxRegion {
+    RKSmapsVma vma;            // as smaps gave it (its path points into the snapshot's text)
+    RKVmaKind kind = RKVmaKind::Anonymous;
+    RKRegionSubmapInfo info;   // what the region walk answers
+    std::string_view detail;   // what regionFileName answers; empty for none
+};
+
+// The address space as one read of smaps saw it. The walk answers every region from it, so
+// smaps is read once per walk however many regions there are.
+struct RKLinuxWalkSnapshot {
+    std::string text;  // the smaps text the regions point into
+    std::vector<RKLinuxRegion> regions;  // ascending, non-overlapping
+    // What follows the last region: KERN_INVALID_ADDRESS, or MACH_SEND_INVALID_DEST when the
+    // process went away while it was read (the regions may then be only a prefix).
+    kern_return_t end = KERN_INVALID_ADDRESS;
+};
 
 class RKLinuxTask : public RKTask {
 public:
@@ -13,6 +36,9 @@ public:
 
     pid_t pid() const override { return pid_; }
     int directoryFd() const { return directory_.get(); }
+
+    // Set while a walk is under way (RKLinuxRegions.cpp); dropped when it reaches the end.
+    std::unique_ptr<RKLinuxWalkSnapshot> snapshot;
 
 private:
     pid_t pid_;

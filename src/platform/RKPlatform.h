@@ -49,6 +49,9 @@ public:
     virtual uint32_t dirtyFlags(pid_t pid) = 0;
     // task_for_pid: KERN_SUCCESS and the task, or the failure code.
     virtual kern_return_t taskForPid(pid_t pid, std::unique_ptr<RKTask>& task) = 0;
+    // Whether live processes map a shared library cache at the architecture's fixed shared
+    // region. Linux has none, so its live processes get no shared-region bounds.
+    virtual bool hasSharedRegion() = 0;
 
     // ---- Address space ----
     // mach_vm_region_recurse at full depth: the first leaf entry ending above `address`.

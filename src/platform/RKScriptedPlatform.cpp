@@ -81,6 +81,8 @@ kern_return_t RKScriptedPlatform::taskForPid(pid_t pid, std::unique_ptr<RKTask>&
     return KERN_SUCCESS;
 }
 
+bool RKScriptedPlatform::hasSharedRegion() { return sharedRegion; }
+
 const RKScriptedRegion* RKScriptedPlatform::regionAtOrAbove(pid_t pid, uint64_t address) {
     auto* process = find(pid);
     if (!process) return nullptr;

@@ -58,6 +58,7 @@ public:
     // Processes in the order listAllPids answers them.
     std::vector<RKScriptedProcess> processes;
     bool listFails = false;
+    bool sharedRegion = false;  // live processes map a shared region (arm64 bounds when 64-bit)
     uint64_t pageSize = 4096;
     uid_t euid = 0;
     pid_t selfPid = 999999;
@@ -86,6 +87,7 @@ public:
     std::optional<std::string> executablePath(pid_t pid) override;
     uint32_t dirtyFlags(pid_t pid) override;
     kern_return_t taskForPid(pid_t pid, std::unique_ptr<RKTask>& task) override;
+    bool hasSharedRegion() override;
     kern_return_t regionRecurse(RKTask& task, uint64_t& address, uint64_t& size,
                                 RKRegionSubmapInfo& info, uint32_t& count) override;
     kern_return_t region(RKTask& task, uint64_t& address, uint64_t& size,

@@ -104,3 +104,7 @@ private:
     std::string displayString_;
     uint64_t pageSize_ = 0;
 };
+
+// The system's process list: the BSD record of every process that could be inspected, in the
+// kernel's pid order. Nothing when the list cannot be read or no record was kept.
+std::optional<std::vector<RKBsdInfo>> RKCopyAllBsdInfo();

@@ -1,0 +1,53 @@
+// The gathering half of the analysis object: construction, the cancel flag and its SIGINT
+// hook, and gatherData, which lets every process fill itself in parallel.
+#include "analysis/RKMemspread.h"
+
+#include <algorithm>
+
+#include "analysis/RKCancelSource.h"
+#include "analysis/RKWorkerPool.h"
+
+namespace {
+
+constexpr const char* kEarlyExitError =
+    "Memspread exited early due to SIGINT and did not finish gathering all data";
+
+// Quality of service as niceness: utility runs below the caller, user-initiated with it.
+int niceIncrementFor(uint32_t qualityOfService) { return qualityOfService == QOS_CLASS_UTILITY ? 5 : 0; }
+
+}  // namespace
+
+RKMemspread::RKMemspread(RKProcessList processes) : processes_(std::move(processes)) {}
+
+RKMemspread::~RKMemspread() = default;
+
+std::unique_ptr<RKCancelSource> RKMemspread::installCancelHandler(std::function<void()> handler) {
+    return RKCancelSource::install(std::move(handler));
+}
+
+RKProcessList RKMemspread::_processesBySortingPidDesc(const RKProcessList& processes) {
+    RKProcessList sorted = processes;
+    std::stable_sort(sorted.begin(), sorted.end(),
+                     [](const auto& a, const auto& b) { return a->pid() > b->pid(); });
+    return sorted;
+}
+
+bool RKMemspread::gatherData() {
+    RKProcessList sorted = _processesBySortingPidDesc(processes_);
+    gatherStartTime_ = RKTime::now();
+    std::atomic<bool> cancelled{false};
+    RKWorkerPoolOptions options;
+    options.threads = RKOnlineCpuCount();
+    options.niceIncrement = niceIncrementFor(qualityOfService_);
+    // The cancel flag is read once per process, before it starts; a started process finishes.
+    RKParallelApply(sorted.size(), options, [&](size_t i) {
+        if (earlyExit_.load()) {
+            cancelled.store(true);
+            return;
+        }
+        sorted[i]->gatherData();
+    });
+    if (cancelled.load()) sorted.back()->_addGlobalError(kEarlyExitError);
+    gatherEndTime_ = RKTime::now();
+    return cancelled.load();
+}

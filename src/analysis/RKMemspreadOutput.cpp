@@ -1,0 +1,138 @@
+// Driving the formatters through one report. Every step calls the formatters in the order they
+// were added, the formatter loop being the innermost loop.
+#include "analysis/RKMemspread.h"
+#include "model/RKAuxData.h"
+#include "model/RKMemoryCategory.h"
+#include "model/RKMemoryObject.h"
+#include "model/RKProcessGroup.h"
+
+namespace {
+
+// A group this large computes its categories once for all members, when they look the same to
+// every member.
+constexpr size_t kCachedCategoriesMinimumGroupSize = 26;
+
+// Formatters get a time even when the clocks could not be read.
+const RKTime& timeOrZero(const std::optional<RKTime>& time) {
+    static const RKTime zero = RKTime::fromReadings(RKClockReadings{});
+    return time ? *time : zero;
+}
+
+}  // namespace
+
+void RKMemspread::addOutputFormatter(std::shared_ptr<RKOutputFormatter> formatter) {
+    outputFormatters_.push_back(std::move(formatter));
+}
+
+void RKMemspread::printSpanlistLikeOutputForProcesses(const RKProcessList& processes) {
+    RKOutputFormatterList listing;
+    for (const auto& formatter : outputFormatters_) {
+        if (formatter->implementsPrintSpanlistLikeOutput()) listing.push_back(formatter);
+    }
+    if (listing.empty()) return;
+    static const RKRegionList kNoRegions;
+    for (const auto& process : processes) {
+        const RKRegionList& regions = process->memoryRegions() ? *process->memoryRegions() : kNoRegions;
+        for (const auto& formatter : listing) formatter->printSpanlistLikeOutputForProcess(*process, regions);
+    }
+}
+
+struct RKMemspread::ReportState {
+    RKProcessList withWarnings;
+    RKProcessList withErrors;
+    std::vector<std::string> globalErrors;
+    std::shared_ptr<RKAuxDataMap> globalAuxData;  // of the processes without errors
+};
+
+void RKMemspread::printOutputVerbose(bool verbose, bool summarize) {
+    const RKProcessList reported = _processesBySortingMemspread(_notHiddenProcesses());
+    for (const auto& formatter : outputFormatters_) {
+        if (formatter->implementsStartAtTime()) formatter->startAtTime(timeOrZero(gatherStartTime_));
+    }
+    if (verbose) printSpanlistLikeOutputForProcesses(reported);
+
+    const RKProcessToGroupsMap groups = _generateProcessToProcessGroups();
+    // From here on the groups, categories and views hold the memory objects.
+    identityMaps_.reset();
+
+    ReportState report;
+    for (const auto& process : reported) _printReportedProcess(process, groups, summarize, report);
+    for (const auto& formatter : outputFormatters_) {
+        formatter->printProcessesWithWarnings(report.withWarnings, report.withErrors, report.globalErrors);
+    }
+
+    const RKCategoryMap summary = _categoriesForAllProcessesShouldSummarize(summarize);
+    RKMemoryTotal summaryTotal;
+    _totalForCategories(summary, &summaryTotal);
+    const bool hadErrors = !report.globalErrors.empty() || !report.withErrors.empty();
+    for (const auto& formatter : outputFormatters_) {
+        formatter->printSummaryCategories(summary, summaryTotal, hadErrors);
+        formatter->printGlobalAuxData(report.globalAuxData);
+        formatter->endAtTime(timeOrZero(gatherEndTime_));
+    }
+}
+
+void RKMemspread::_printReportedProcess(const std::shared_ptr<RKProcess>& reported,
+                                        const RKProcessToGroupsMap& groups, bool summarize, ReportState& report) {
+    RKProcess& process = *reported;
+    const bool hasErrors = !process.errors().empty();
+    if (!process.warnings().empty()) report.withWarnings.push_back(reported);
+    std::shared_ptr<RKAuxDataMap> auxData = process.auxData();
+    if (hasErrors) {
+        report.withErrors.push_back(reported);
+    } else if (auxData) {
+        // The process's own leaves decide what is aggregated.
+        report.globalAuxData = auxData->mergeWithData(report.globalAuxData);
+    }
+
+    _printProcessHeader(process, hasErrors);
+    auto list = groups.find(process.pid());
+    _printProcessGroups(process, hasErrors || list == groups.end() ? nullptr : &list->second, summarize);
+    for (const auto& formatter : outputFormatters_) formatter->printProcessAuxData(auxData);
+
+    const auto& errors = process.globalErrors();
+    report.globalErrors.insert(report.globalErrors.end(), errors.begin(), errors.end());
+}
+
+void RKMemspread::_printProcessHeader(RKProcess& process, bool hasErrors) {
+    auto entry = pidToMemspread_.find(process.pid());
+    const uint64_t memspread = entry == pidToMemspread_.end() ? 0 : entry->second;
+    for (const auto& formatter : outputFormatters_) {
+        formatter->printProcessHeader(process);
+        if (!hasErrors) formatter->printProcessTotal(memspread, process);
+        formatter->endProcessHeader(process);
+    }
+}
+
+// `groups` is null for a process with errors or without groups: it gets one empty table.
+void RKMemspread::_printProcessGroups(RKProcess& process, const RKProcessGroupList* groups, bool summarize) {
+    if (!groups) {
+        const RKCategoryMap none;
+        const RKMemoryTotal zero;
+        for (const auto& formatter : outputFormatters_) formatter->printProcessCategories(none, zero);
+        return;
+    }
+    for (const auto& group : *groups) _printGroup(*group, process, summarize);
+}
+
+void RKMemspread::_printGroup(RKProcessGroup& group, RKProcess& process, bool summarize) {
+    uint8_t processView = RKProcessViewNone;
+    std::shared_ptr<RKCategoryMap> categories = group.consumeCachedCategories();
+    if (!categories) {
+        categories = _categoriesForObjects(group.objects(), process, &processView, summarize);
+        // Identical for every member: the others take this map instead of computing it again.
+        if (processView == RKProcessViewNone && group.count() >= kCachedCategoriesMinimumGroupSize) {
+            group.attachCachedCategories(categories, static_cast<uint32_t>(group.count() - 1));
+        }
+    }
+    RKMemoryTotal total;
+    _totalForCategories(*categories, &total);
+    const bool hasProcessView = processView == RKProcessViewPresent;
+    for (const auto& formatter : outputFormatters_) {
+        if (group.count() == 1) {
+            formatter->printProcessCategories(*categories, total);
+        } else {
+            formatter->printSharedCategories(*categories, group, process, hasProcessView, total);
+        }
+    }
+}

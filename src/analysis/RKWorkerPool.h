@@ -1,0 +1,16 @@
+// Runs work(0) .. work(count - 1) on a pool of worker threads and returns when all have run:
+// the concurrent apply of gathering. Items are taken in index order, each by one worker.
+#pragma once
+
+#include <cstddef>
+#include <functional>
+
+struct RKWorkerPoolOptions {
+    size_t threads = 1;     // at most this many workers (never more than there are items)
+    int niceIncrement = 0;  // added to each worker's niceness (Linux nice is per thread)
+};
+
+void RKParallelApply(size_t count, const RKWorkerPoolOptions& options, const std::function<void(size_t)>& work);
+
+// One worker per online CPU.
+size_t RKOnlineCpuCount();

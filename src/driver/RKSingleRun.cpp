@@ -1,0 +1,36 @@
+#include "driver/RKSingleRun.h"
+
+#include <unistd.h>
+
+#include <cstdio>
+#include <memory>
+
+#include "analysis/RKCancelSource.h"
+#include "analysis/RKMemspread.h"
+
+void RKSingleRun(const RKMemspreadArgs& args, const RKTargetMap& targets,
+                 const RKOutputFormatterList& formatters) {
+    // The map is ordered by key (pid for live processes), which makes the identity tie-breaks of
+    // the analysis repeatable from run to run.
+    RKProcessList processes;
+    processes.reserve(targets.size());
+    for (const auto& entry : targets) processes.push_back(entry.second);
+    RKMemspread memspread(std::move(processes));
+
+    // On a terminal Ctrl-C simply ends the program; with redirected output it cuts gathering
+    // short and the report of what was gathered is still written.
+    std::unique_ptr<RKCancelSource> cancelSource;
+    if (!isatty(STDOUT_FILENO)) {
+        cancelSource = RKMemspread::installCancelHandler([&memspread] {
+            memspread.cancel();
+            std::fprintf(stderr, "Exiting early due to SIGINT\n");
+        });
+    }
+    memspread.gatherData();
+    memspread.analyzeData();
+    // Restores SIGINT's default action before any output, so Ctrl-C while writing ends the process.
+    cancelSource.reset();
+
+    for (const auto& formatter : formatters) memspread.addOutputFormatter(formatter);
+    memspread.printOutputVerbose(args.spanlistLikeOutput(), args.summarize());
+}

@@ -1,0 +1,174 @@
+#include "model/RKMemoryObject.h"
+
+#include <algorithm>
+
+#include "model/RKAssert.h"
+#include "model/RKMemoryRegion.h"
+#include "process/RKAnalysisSettings.h"
+
+namespace {
+
+const std::string kNoName;
+
+}  // namespace
+
+RKMemoryObject::RKMemoryObject() : memoryRegions_(std::make_shared<RKRegionList>()) {}
+
+void RKMemoryObject::addRegion(const std::shared_ptr<RKMemoryRegion>& region, const RKProcess& process) {
+    _addRegion(region, process.pageSize(), &process);
+}
+
+void RKMemoryObject::addRegion(const std::shared_ptr<RKMemoryRegion>& region, uint64_t pageSize) {
+    _addRegion(region, pageSize, nullptr);
+}
+
+void RKMemoryObject::_addRegion(const std::shared_ptr<RKMemoryRegion>& region, uint64_t pageSize,
+                                const RKProcess* process) {
+    RKAssert(!accurateSizes_, "RKMemoryObject", "region added to a finalized memory object");
+    memoryRegions_->push_back(region);
+    containsFakeRegion_ = containsFakeRegion_ || region->isFake();
+    // Listed (and counted as a region), but there is no VM object whose pages it could add.
+    if (region->object_id == 0) return;
+
+    if (process) {
+        // Once the map exists it takes every region of every process, eligible or not.
+        if (!processMemoryRegions_ && region->eligibleForProcessView()) processMemoryRegions_.emplace();
+        if (processMemoryRegions_) (*processMemoryRegions_)[process->pid()].push_back(region);
+    }
+    if (!rangeList_) rangeList_ = std::make_unique<RKRangeList>();
+    rangeList_->addRegion(*region, pageSize);
+    region->freeSubrangeList();
+}
+
+void RKMemoryObject::finalizeUsingRegionDirtySize(bool useRegionDirtySize) {
+    RKAssert(!accurateSizes_, "RKMemoryObject", "memory object finalized twice");
+    RKMemoryTotal merged = rangeList_ ? rangeList_->sum() : RKMemoryTotal{};
+
+    if (useRegionDirtySize) {
+        totalDirtySize_ = 0;
+        totalSwappedSize_ = 0;
+        for (const auto& region : *memoryRegions_) {
+            totalDirtySize_ += region->dirtySize;
+            totalSwappedSize_ += region->swappedSize;
+        }
+    } else {
+        totalDirtySize_ = merged.dirty;
+        totalSwappedSize_ = merged.swapped;
+        if (processMemoryRegions_ && RKAnalysisSettings::breakDownPhysMemspread()) _raiseToProcessSums();
+    }
+    totalCleanSize_ = merged.clean;
+    totalReclaimableSize_ = merged.reclaimable;
+    totalWiredSize_ = merged.wired;
+    rangeList_.reset();
+
+    if (processMemoryRegions_ && !_keepsProcessViews()) processMemoryRegions_.reset();
+    if (containsFakeRegion_) _nameFakeRegions();
+    accurateSizes_ = true;
+}
+
+// Merging by offset can report less than one process's own regions do (a process's owned
+// memory is charged in full to its regions); the object never shows less than any one process.
+void RKMemoryObject::_raiseToProcessSums() {
+    for (const auto& [pid, regions] : *processMemoryRegions_) {
+        uint64_t dirty = 0, swapped = 0;
+        for (const auto& region : regions) {
+            dirty += region->dirtySize;
+            swapped += region->swappedSize;
+        }
+        totalDirtySize_ = std::max(totalDirtySize_, dirty);
+        totalSwappedSize_ = std::max(totalSwappedSize_, swapped);
+    }
+}
+
+// Views can differ only when two or more processes map the object and at least one of them
+// does not see it whole through a single region.
+bool RKMemoryObject::_keepsProcessViews() const {
+    if (processMemoryRegions_->size() < 2) return false;
+    for (const auto& [pid, regions] : *processMemoryRegions_) {
+        if (regions.size() != 1) return true;
+        const RKMemoryRegion& region = *regions.front();
+        bool seesWhole = region.dirtySize == totalDirtySize_ && region.swappedSize == totalSwappedSize_ &&
+                         region.cleanNonSpecSize == totalCleanSize_ &&
+                         region.reclaimableSize == totalReclaimableSize_ && region.wiredSize() == totalWiredSize_;
+        if (!seesWhole) return true;
+    }
+    return false;
+}
+
+// Owned but unmapped memory takes the name of a mapping of the same object.
+void RKMemoryObject::_nameFakeRegions() {
+    const RKMemoryRegion* canonical = _canonicalRegion();
+    if (!canonical || canonical->isFake()) return;
+    for (const auto& region : *memoryRegions_) {
+        if (!region->isFake()) continue;
+        region->name = canonical->name;
+        region->detailedName = canonical->detailedName;
+    }
+}
+
+std::shared_ptr<RKMemoryObject> RKMemoryObject::copy() const {
+    RKAssert(accurateSizes_ && !rangeList_, "RKMemoryObject", "copy of a memory object that is not finalized");
+    auto copied = std::make_shared<RKMemoryObject>();
+    copied->totalDirtySize_ = totalDirtySize_;
+    copied->totalSwappedSize_ = totalSwappedSize_;
+    copied->totalCleanSize_ = totalCleanSize_;
+    copied->totalWiredSize_ = totalWiredSize_;
+    copied->accurateSizes_ = accurateSizes_;
+    copied->ownerPid_ = ownerPid_;
+    copied->memoryRegions_ = memoryRegions_;
+    copied->containsFakeRegion_ = containsFakeRegion_;
+    return copied;
+}
+
+std::shared_ptr<RKMemoryObject> RKMemoryObject::viewForProcess(const RKProcess& process) {
+    std::shared_ptr<RKMemoryObject> view = shared_from_this();
+    if (processMemoryRegions_ && !processMemoryRegions_->empty()) {
+        auto own = processMemoryRegions_->find(process.pid());
+        if (own == processMemoryRegions_->end()) return view;  // whole, whoever owns it
+        view = std::make_shared<RKMemoryObject>();
+        view->ownerPid_ = ownerPid_;
+        for (const auto& region : own->second) view->addRegion(region, process.pageSize());
+        view->finalizeUsingRegionDirtySize(process.breakDownPhysMemspread());
+    }
+    if (ownerPid_ != -1 && ownerPid_ != process.pid()) {
+        // Memory owned by another process costs this one nothing dirty or swapped.
+        auto charged = view->copy();
+        charged->totalDirtySize_ = 0;
+        charged->totalSwappedSize_ = 0;
+        charged->totalCleanSize_ = view->totalCleanSize_ + totalDirtySize_ + totalSwappedSize_;
+        view = charged;
+    }
+    return view;
+}
+
+const RKMemoryRegion* RKMemoryObject::_canonicalRegion() const {
+    if (memoryRegions_->empty()) return nullptr;
+    const RKMemoryRegion* first = memoryRegions_->front().get();
+    if (!first->inSharedCache && ownerPid_ == -1) return first;
+    for (const auto& region : *memoryRegions_) {
+        bool qualifies = first->inSharedCache ? !region->unusedSharedCacheRegion : !region->isFake();
+        if (qualifies) return region.get();
+    }
+    return first;
+}
+
+const std::string& RKMemoryObject::name() const {
+    const RKMemoryRegion* canonical = _canonicalRegion();
+    return canonical ? canonical->name : kNoName;
+}
+
+const std::string& RKMemoryObject::detailedName() const {
+    const RKMemoryRegion* canonical = _canonicalRegion();
+    return canonical ? canonical->detailedName : kNoName;
+}
+
+std::string RKMemoryObject::fullName() const {
+    const RKMemoryRegion* canonical = _canonicalRegion();
+    return canonical ? canonical->fullName() : std::string();
+}
+
+bool RKMemoryObject::verbose() const { return !memoryRegions_->empty() && memoryRegions_->front()->verbose; }
+
+bool RKMemoryObject::couldHaveProcessView() const {
+    return (processMemoryRegions_ && !processMemoryRegions_->empty()) || ownerPid_ != -1;
+}

@@ -1,0 +1,189 @@
+#include "platform/RKLinuxWalk.h"
+
+#include <fcntl.h>
+#include <sys/mman.h>
+#include <sys/stat.h>
+#include <sys/sysmacros.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <charconv>
+#include <cstring>
+#include <map>
+#include <mutex>
+#include <utility>
+
+#include "platform/RKProcFile.h"
+#include "platform/RKUniqueFd.h"
+
+namespace {
+
+thread_local std::string tSpareText;
+
+// Mount tables by (proc root, mount namespace): processes of one namespace share one read of
+// mountinfo. A device missing from a table makes the walk read the target's file again.
+class RKMountTableCache {
+public:
+    std::shared_ptr<const RKMountTable> get(const std::string& procRoot, uint64_t ns) {
+        std::lock_guard<std::mutex> lock(mutex_);
+        auto it = tables_.find({procRoot, ns});
+        return it == tables_.end() ? nullptr : it->second;
+    }
+    void put(const std::string& procRoot, uint64_t ns, std::shared_ptr<const RKMountTable> table) {
+        std::lock_guard<std::mutex> lock(mutex_);
+        tables_[{procRoot, ns}] = std::move(table);
+    }
+
+private:
+    std::mutex mutex_;
+    std::map<std::pair<std::string, uint64_t>, std::shared_ptr<const RKMountTable>> tables_;
+};
+
+RKMountTableCache& mountTableCache() {
+    static RKMountTableCache cache;
+    return cache;
+}
+
+// Inode of the namespace link `name` (e.g. "ns/mnt") of the process; 0 when it cannot be read.
+uint64_t namespaceInode(int dirfd, const char* name) {
+    struct stat st {};
+    if (::fstatat(dirfd, name, &st, 0) != 0) return 0;
+    return st.st_ino;
+}
+
+std::shared_ptr<const RKMountTable> readMountTable(int dirfd) {
+    std::string text;
+    if (RKReadFileAt(dirfd, "mountinfo", text) != 0) return std::make_shared<RKMountTable>();
+    return std::make_shared<RKMountTable>(RKParseMountInfo(text));
+}
+
+std::shared_ptr<const RKMountTable> mountTableFor(int dirfd, const std::string& procRoot, uint64_t ns,
+                                                  bool reread) {
+    if (ns != 0 && !reread) {
+        if (auto table = mountTableCache().get(procRoot, ns)) return table;
+    }
+    auto table = readMountTable(dirfd);
+    if (ns != 0) mountTableCache().put(procRoot, ns, table);
+    return table;
+}
+
+bool missingDevice(const std::vector<RKSmapsVma>& vmas, const RKVmaContext& context) {
+    for (const auto& vma : vmas) {
+        if (RKVmaNeedsMountTable(vma, context) && !context.mounts->count(RKDeviceKey(vma.devMajor, vma.devMinor)))
+            return true;
+    }
+    return false;
+}
+
+bool anySysV(const std::vector<RKSmapsVma>& vmas) {
+    for (const auto& vma : vmas)
+        if (vma.path.substr(0, 5) == "/SYSV") return true;
+    return false;
+}
+
+kern_return_t readErrorCode(int error) {
+    if (error == ESRCH || error == ENOENT) return MACH_SEND_INVALID_DEST;
+    if (error == EACCES || error == EPERM) return KERN_PROTECTION_FAILURE;
+    return KERN_FAILURE;
+}
+
+// A process whose address space is gone: reaped (its files fail), or exiting or a zombie
+// (statm reads all zeros once the mm is released).
+bool processGone(int dirfd) {
+    std::string statm;
+    int error = RKReadFileAt(dirfd, "statm", statm);
+    if (error != 0) return error == ESRCH || error == ENOENT;
+    uint64_t size = 0;
+    std::from_chars(statm.data(), statm.data() + statm.size(), size);
+    return size == 0;
+}
+
+// stat of map_files/START-END: the file itself, as no maps line can be wrong about. Needs
+// CAP_SYS_ADMIN; `allowed` turns false at the first refusal so the walk stops asking.
+std::optional<RKFileIdentity> mappedFileIdentity(int dirfd, const RKSmapsVma& vma, bool& allowed) {
+    if (!allowed) return std::nullopt;
+    char name[64];
+    char* p = name;
+    std::memcpy(p, "map_files/", 10);
+    p += 10;
+    p = std::to_chars(p, name + sizeof(name) - 1, vma.start, 16).ptr;
+    *p++ = '-';
+    p = std::to_chars(p, name + sizeof(name) - 1, vma.end, 16).ptr;
+    *p = '\0';
+    struct stat st {};
+    if (::fstatat(dirfd, name, &st, 0) != 0) {
+        if (errno == EPERM || errno == EACCES) allowed = false;
+        return std::nullopt;
+    }
+    return RKFileIdentity{RKDeviceKey(major(st.st_dev), minor(st.st_dev)), static_cast<uint64_t>(st.st_ino)};
+}
+
+void classifyAll(RKLinuxTask& task, const std::vector<RKSmapsVma>& vmas, const RKVmaContext& context,
+                 RKLinuxWalkSnapshot& snapshot) {
+    bool mapFilesAllowed = true;
+    snapshot.regions.reserve(vmas.size());
+    for (const auto& vma : vmas) {
+        RKLinuxRegion region;
+        region.vma = vma;
+        region.kind = RKClassifyVma(vma, context);
+        std::optional<RKFileIdentity> identity;
+        if (region.kind == RKVmaKind::File) identity = mappedFileIdentity(task.directoryFd(), vma, mapFilesAllowed);
+        region.info = RKRegionInfoForVma(vma, region.kind, context, identity);
+        region.detail = RKDetailForVma(vma, region.kind);
+        snapshot.regions.push_back(region);
+    }
+}
+
+}  // namespace
+
+std::optional<uint64_t> RKShmemDevice() {
+    static const std::optional<uint64_t> device = []() -> std::optional<uint64_t> {
+        RKUniqueFd fd(::memfd_create("memspread-shmem-probe", MFD_CLOEXEC));
+        struct stat st {};
+        if (!fd.valid() || ::fstat(fd.get(), &st) != 0) return std::nullopt;
+        return RKDeviceKey(major(st.st_dev), minor(st.st_dev));
+    }();
+    return device;
+}
+
+kern_return_t RKLoadWalkSnapshot(RKLinuxTask& task, const std::string& procRoot, uint64_t pageSize,
+                                 std::unique_ptr<RKLinuxWalkSnapshot>& snapshot) {
+    auto fresh = std::make_unique<RKLinuxWalkSnapshot>();
+    fresh->text.swap(tSpareText);
+    int error = RKReadFileAt(task.directoryFd(), "smaps", fresh->text);
+    if (error != 0) {
+        RKRecycleWalkSnapshot(std::move(fresh));
+        return readErrorCode(error);
+    }
+    if (fresh->text.empty()) {  // a zombie's address space reads as nothing
+        RKRecycleWalkSnapshot(std::move(fresh));
+        return MACH_SEND_INVALID_DEST;
+    }
+    std::vector<RKSmapsVma> vmas;
+    RKParseSmaps(fresh->text, vmas);
+
+    RKVmaContext context;
+    context.pid = task.pid();
+    context.pageSize = pageSize;
+    context.shmemDevice = RKShmemDevice();
+    uint64_t mountNamespace = namespaceInode(task.directoryFd(), "ns/mnt");
+    auto mounts = mountTableFor(task.directoryFd(), procRoot, mountNamespace, false);
+    context.mounts = mounts.get();
+    if (missingDevice(vmas, context)) {
+        mounts = mountTableFor(task.directoryFd(), procRoot, mountNamespace, true);
+        context.mounts = mounts.get();
+    }
+    if (anySysV(vmas)) context.ipcNamespace = namespaceInode(task.directoryFd(), "ns/ipc");
+
+    classifyAll(task, vmas, context, *fresh);
+    fresh->end = processGone(task.directoryFd()) ? MACH_SEND_INVALID_DEST : KERN_INVALID_ADDRESS;
+    snapshot = std::move(fresh);
+    return KERN_SUCCESS;
+}
+
+void RKRecycleWalkSnapshot(std::unique_ptr<RKLinuxWalkSnapshot> snapshot) {
+    if (snapshot && snapshot->text.capacity() > tSpareText.capacity()) {
+        snapshot->text.clear();
+        tSpareText.swap(snapshot->text);
+    }
+}

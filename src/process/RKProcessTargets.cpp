@@ -1,0 +1,114 @@
+// The class operations that read the system's process list for target selection: the list
+// itself, name and pid lookup, descendants, and the idle-exit filter.
+#include <algorithm>
+#include <cstdlib>
+#include <unordered_map>
+#include <unordered_set>
+
+#include "platform/RKPlatform.h"
+#include "process/RKProcess.h"
+
+namespace {
+
+// A signed decimal integer at the start of the text: leading white space and a sign allowed,
+// trailing text ignored ("12abc" is 12).
+std::optional<long long> leadingInteger(const std::string& text) {
+    const char* start = text.c_str();
+    char* end = nullptr;
+    long long value = std::strtoll(start, &end, 10);
+    if (end == start) return std::nullopt;
+    return value;
+}
+
+// Resolves one description against the list. Every process whose name equals it is taken by
+// name; the walk stops at a process whose pid equals its number, which is taken by number.
+bool resolveDescription(const std::string& description, const std::vector<RKBsdInfo>& list, RKPidNameMap& result) {
+    std::optional<long long> number = leadingInteger(description);
+    bool found = false;
+    for (const RKBsdInfo& info : list) {
+        if (RKProcess::_nameForBsdInfo(info) == description) {
+            result[info.pbi_pid] = description;
+            found = true;
+        } else if (number && *number == info.pbi_pid) {
+            result[info.pbi_pid] = std::nullopt;
+            return true;
+        }
+    }
+    return found;
+}
+
+}  // namespace
+
+std::optional<std::vector<RKBsdInfo>> RKCopyAllBsdInfo() {
+    RKPlatform& platform = RKPlatform::current();
+    auto pids = platform.listAllPids();
+    if (!pids) return std::nullopt;
+    std::vector<RKBsdInfo> records;
+    records.reserve(pids->size());
+    for (pid_t pid : *pids)
+        if (auto info = platform.bsdInfo(pid)) records.push_back(*info);  // gone or hidden: dropped
+    if (records.empty()) return std::nullopt;
+    return records;
+}
+
+std::optional<RKTargetMap> RKProcess::allProcessesExcludingPids(const std::set<pid_t>& excluded) {
+    auto list = RKCopyAllBsdInfo();
+    if (!list) return std::nullopt;
+    RKTargetMap result;
+    for (const RKBsdInfo& info : *list) {
+        if (excluded.count(info.pbi_pid)) continue;
+        if (auto process = processWithBsdInfo(info)) result[info.pbi_pid] = std::move(process);
+    }
+    return result;
+}
+
+std::optional<RKPidNameMap> RKProcess::pidsForStringDescriptions(const std::vector<std::string>& descriptions,
+                                                                 std::vector<std::string>* errors) {
+    auto list = RKCopyAllBsdInfo();
+    if (!list) {
+        if (errors) *errors = {"Unable to obtain system process list"};
+        return std::nullopt;
+    }
+    RKPidNameMap result;
+    std::vector<std::string> messages;
+    for (const std::string& description : descriptions)
+        if (!resolveDescription(description, *list, result))
+            messages.push_back("Unable to find pid for process matching '" + description + "'");
+    if (errors && !messages.empty()) *errors = std::move(messages);
+    return result;
+}
+
+// Breadth-first over a parent -> children index built once, so the cost is linear in the
+// number of processes; each generation keeps the process list's order.
+std::optional<std::vector<pid_t>> RKProcess::childPidsForPids(const std::vector<pid_t>& pids) {
+    auto list = RKCopyAllBsdInfo();
+    if (!list) return std::nullopt;
+    std::unordered_map<pid_t, std::vector<size_t>> children;
+    for (size_t i = 0; i < list->size(); i++) children[(*list)[i].pbi_ppid].push_back(i);
+
+    std::unordered_set<pid_t> visited;
+    std::vector<pid_t> frontier;
+    for (pid_t pid : pids)
+        if (visited.insert(pid).second) frontier.push_back(pid);
+    std::vector<pid_t> result;
+    while (!frontier.empty()) {
+        result.insert(result.end(), frontier.begin(), frontier.end());
+        std::vector<size_t> next;
+        for (pid_t parent : frontier) {
+            auto it = children.find(parent);
+            if (it == children.end()) continue;
+            for (size_t index : it->second)
+                if (visited.insert((*list)[index].pbi_pid).second) next.push_back(index);
+        }
+        std::sort(next.begin(), next.end());
+        frontier.clear();
+        for (size_t index : next) frontier.push_back((*list)[index].pbi_pid);
+    }
+    return result;
+}
+
+RKTargetMap RKProcess::removeIdleExitCleanProcessesFrom(const RKTargetMap& targets) {
+    RKTargetMap result = targets;
+    std::erase_if(result, [](const auto& entry) { return entry.second->idleExitStatus() == 2; });
+    return result;
+}
