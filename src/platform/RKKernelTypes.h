@@ -15,6 +15,7 @@ inline constexpr kern_return_t KERN_INVALID_ADDRESS = 1;   // past the last regi
 inline constexpr kern_return_t KERN_PROTECTION_FAILURE = 2;
 inline constexpr kern_return_t KERN_INVALID_ARGUMENT = 4;  // a page query of a process that is gone
 inline constexpr kern_return_t KERN_FAILURE = 5;
+inline constexpr kern_return_t KERN_RESOURCE_SHORTAGE = 6;  // out of file descriptors
 inline constexpr kern_return_t MACH_SEND_INVALID_DEST = 0x10000003;  // the process is gone
 
 // pbi_flags bits.

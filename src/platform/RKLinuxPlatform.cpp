@@ -1,6 +1,7 @@
 #include "platform/RKLinuxPlatform.h"
 
 #include <fcntl.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <time.h>
 #include <unistd.h>
@@ -19,22 +20,36 @@ uint64_t nanoseconds(const timespec& ts) {
     return static_cast<uint64_t>(ts.tv_sec) * 1000000000ull + static_cast<uint64_t>(ts.tv_nsec);
 }
 
+kern_return_t openFailure(int error) {
+    if (error == EACCES || error == EPERM) return KERN_PROTECTION_FAILURE;
+    if (error == EMFILE || error == ENFILE) return KERN_RESOURCE_SHORTAGE;
+    return KERN_INVALID_ARGUMENT;
+}
+
+// Every measured process holds a descriptor of its /proc directory until the report is done, so
+// measuring all processes of a busy machine needs more than the usual soft limit of 1024.
+void raiseDescriptorLimit() {
+    rlimit limit{};
+    if (getrlimit(RLIMIT_NOFILE, &limit) != 0 || limit.rlim_cur >= limit.rlim_max) return;
+    limit.rlim_cur = limit.rlim_max;
+    setrlimit(RLIMIT_NOFILE, &limit);
+}
+
 }  // namespace
 
 RKLinuxPlatform::RKLinuxPlatform(std::string procRoot, std::string sysRoot)
-    : procRoot_(std::move(procRoot)), sysRoot_(std::move(sysRoot)) {}
+    : procRoot_(std::move(procRoot)), sysRoot_(std::move(sysRoot)) {
+    static const bool raised = (raiseDescriptorLimit(), true);
+    (void)raised;
+}
 
 kern_return_t RKLinuxPlatform::taskForPid(pid_t pid, std::unique_ptr<RKTask>& task) {
     std::string path = procRoot_ + "/" + std::to_string(pid);
     RKUniqueFd directory(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (!directory.valid()) {
-        return (errno == EACCES || errno == EPERM) ? KERN_PROTECTION_FAILURE : KERN_INVALID_ARGUMENT;
-    }
+    if (!directory.valid()) return openFailure(errno);
     // Opening smaps is the kernel's ptrace-read check: without it nothing can be measured.
     RKUniqueFd smaps(::openat(directory.get(), "smaps", O_RDONLY | O_CLOEXEC));
-    if (!smaps.valid()) {
-        return (errno == EACCES || errno == EPERM) ? KERN_PROTECTION_FAILURE : KERN_INVALID_ARGUMENT;
-    }
+    if (!smaps.valid()) return openFailure(errno);
     task = std::make_unique<RKLinuxTask>(pid, std::move(directory));
     return KERN_SUCCESS;
 }

@@ -41,6 +41,7 @@ const char* mach_error_string(kern_return_t code) {
         case KERN_PROTECTION_FAILURE: return "permission denied";
         case KERN_INVALID_ARGUMENT: return "process is gone";
         case KERN_FAILURE: return "failure";
+        case KERN_RESOURCE_SHORTAGE: return "too many open files";
         case MACH_SEND_INVALID_DEST: return "process is gone";
         default: return "unknown error";
     }
