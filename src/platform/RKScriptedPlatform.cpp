@@ -172,6 +172,8 @@ int RKScriptedPlatform::ledgerEntries(RKTask& task, std::vector<int64_t>& balanc
     if (!process) return ESRCH;
     if (process->ledgerErrno != 0) return process->ledgerErrno;
     balances = process->ledgerBalances;
+    // A kernel answers every entry of its template; unscripted ones hold 0.
+    if (balances.size() < ledgerNames.size()) balances.resize(ledgerNames.size(), 0);
     return 0;
 }
 

@@ -39,7 +39,7 @@ struct RKScriptedProcess {
     int rusageErrno = 0;
     RKRusageInfo rusage;
     int ledgerErrno = 0;
-    std::vector<int64_t> ledgerBalances;
+    std::vector<int64_t> ledgerBalances;  // in template order; entries not given answer 0
     int ownedErrno = ENOENT;
     std::vector<RKOwnedVmObjectRecord> owned;
 };

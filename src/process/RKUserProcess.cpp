@@ -1,8 +1,42 @@
 #include "process/RKUserProcess.h"
 
+#include <cerrno>
 #include <cstdio>
+#include <cstring>
+
+#include "model/RKAssert.h"
 
 namespace {
+
+// The ledger template is the same for every process: read once for the run.
+struct RKLedgerTemplate {
+    int64_t count = -1;           // -1 after a failure
+    int64_t pageTableIndex = -1;  // of the entry named "page_table"; -1 when absent
+};
+
+RKLedgerTemplate readLedgerTemplate() {
+    RKLedgerTemplate result;
+    std::vector<std::string> names;
+    int error = RKPlatform::current().ledgerTemplate(names);
+    if (error != 0) {
+        errno = error;
+        std::perror("Unable to retrieve ledger template info");
+        return result;
+    }
+    result.count = static_cast<int64_t>(names.size());
+    for (size_t i = 0; i < names.size(); i++) {
+        if (names[i] == "page_table") {
+            result.pageTableIndex = static_cast<int64_t>(i);
+            break;
+        }
+    }
+    return result;
+}
+
+const RKLedgerTemplate& sharedLedgerTemplate() {
+    static const RKLedgerTemplate ledgerTemplate = readLedgerTemplate();  // thread-safe, once
+    return ledgerTemplate;
+}
 
 struct RKSharedRegionBounds {
     uint64_t base;
@@ -47,8 +81,6 @@ bool RKUserProcess::_populateTask() {
     return true;
 }
 
-void RKUserProcess::gatherData() {}
-
 bool RKUserProcess::_setSharedRegionFromPlatform(int32_t platform) {
     if (platform >= 0 && platform <= RKPlatformArm64_32) {
         sharedRegionBase_ = kSharedRegions[platform].base;
@@ -70,8 +102,21 @@ void RKUserProcess::_gatherPhysMemspread() {
     phys_memspread_peak_ = usage.ri_lifetime_max_phys_memspread;
 }
 
-// The page-table ledger comes with the per-process figures of the walk.
-void RKUserProcess::_gatherLedgers() {}
+void RKUserProcess::_gatherLedgers() {
+    if (!breakDownPhysMemspread() || !_isAlive() || !task_) return;
+    const RKLedgerTemplate& ledgerTemplate = sharedLedgerTemplate();
+    if (ledgerTemplate.pageTableIndex < 0) return;
+    std::vector<int64_t> balances;
+    int error = RKPlatform::current().ledgerEntries(*task_, balances);
+    if (error != 0) {
+        errno = error;
+        _addErrnoWarningWithDescription("Unable to retrieve ledger entry info");
+        return;
+    }
+    auto index = static_cast<size_t>(ledgerTemplate.pageTableIndex);
+    RKAssert(index < balances.size(), "RKUserProcess", "pageTableIndex < entry count");
+    ledgers_ = balances[index] > 0 ? static_cast<uint64_t>(balances[index]) : 0;
+}
 
 void RKUserProcess::_gatherIdleExitStatus() {
     if (!_isAlive()) return;

@@ -4,14 +4,41 @@
 // sources of its own, so every source-specific step is overridable.
 #pragma once
 
+#include <functional>
+#include <map>
 #include <memory>
 #include <optional>
+#include <string>
 #include <vector>
 
 #include "platform/RKPlatform.h"
 #include "process/RKProcess.h"
 
 class RKImage;
+class RKMemoryRegion;
+
+// One entry of the address-space walk: start, size, the region record, the purge state
+// (VM_PURGABLE_*), the path of the mapped file, a ready-made region name (the live walk gives
+// none) and whether the region is listed only in verbose output. Returns true to stop the walk.
+using RKRegionCallback =
+    std::function<bool(uint64_t start, uint64_t size, const RKRegionSubmapInfo& info, int purgeState,
+                       const std::optional<std::string>& path, const std::optional<std::string>& name,
+                       bool verbose)>;
+
+// Owned VM objects by object id; absent when there is no list at all.
+using RKOwnedVmObjectMap = std::map<uint64_t, RKOwnedVmObjectRecord>;
+
+// What one region-building pass carries from region to region and into the steps after it.
+struct RKRegionWalkState {
+    RKRegionList regions;
+    // The region made of the kernel's owned-memory pseudo-region, kept out of `regions` until
+    // it has been reduced by the owned memory found mapped.
+    std::shared_ptr<RKMemoryRegion> unmappedOwnedRegion;
+    uint64_t mappedOwnedTotal = 0;  // bytes of owned memory charged to mapped regions
+    bool hidden = false;
+    bool breakDown = false;
+    bool sharingAnalysisDisabled = false;
+};
 
 // Architectures that decide where the shared library cache is mapped.
 enum RKPlatformCode : int32_t {
@@ -35,9 +62,22 @@ public:
     bool _populateTask() override;
     bool _isAlive() const override { return true; }
 
-    // OVERRIDABLE STEP, NOT YET BUILT: the address-space walk that fills memoryRegions comes
-    // with the region walk. Until then a user process gathers nothing and stays ungathered.
+    // Images, fresh figures and owned objects (unless hidden), then the walk that fills
+    // memoryRegions. Once only: a gathered process is left as it is.
     void gatherData() override;
+    // Walks the address space in ascending order. A failing kernel call ends the walk after a
+    // line on standard error and an error (or, for a process that exited, a warning).
+    virtual void enumerateRegions(const RKRegionCallback& callback);
+    // The start of the last top-level entry below the shared region, found by bisection; 0 when
+    // there is none (always without a shared region).
+    uint64_t _lastNonSharedCacheRegion();
+    // Builds memoryRegions from the walk, then appends the regions that have no address.
+    virtual void _gatherMemoryData();
+    // Records a failed kernel call: a warning suffixed " (process exited)" or " (zombie)" when
+    // `error` is `expected` and the process is gone, an error otherwise.
+    void _processMachVMError(kern_return_t error, kern_return_t expected);
+    // "<display>: <description> - <errno text>" on standard error and in the warnings.
+    void _addErrnoWarningWithDescription(const std::string& description);
 
     // A live process is never translated on this platform; the snapshot source reads it.
     virtual void _gatherIsTranslated() {}
@@ -48,6 +88,27 @@ public:
     virtual void _gatherLedgers();
     virtual void _gatherIdleExitStatus();
     void _setIdleExitStatusFromDirtyFlags(uint32_t flags);
+
+    // ---- Steps filled in by later sources of the process's memory ----
+    // Sizes a region from page dispositions instead of the region counters. Not yet: true.
+    virtual bool _populateMemoryRegionWithPageQueries(RKMemoryRegion& region, const RKRegionSubmapInfo& info);
+    // Splits a mixed region into per-page-state runs. Not yet: no subranges.
+    virtual void _addSubrangesForRegion(RKMemoryRegion& region, int purgeState);
+    // Reads the loaded images. Not yet: none, so no region is named after an image.
+    virtual void _gatherImageData() {}
+    // Names a region after the image segment it lies in. Not yet: false.
+    virtual bool _nameRegionFromImages(RKMemoryRegion& region, RKRegionWalkState& state);
+    // The VM objects the task owns. Not yet: no list.
+    virtual std::optional<RKOwnedVmObjectMap> _gatherOwnedVmObjects() { return std::nullopt; }
+    // Cuts an entry of the shared region at image boundaries into `state.regions`; false when a
+    // page query failed. Not yet: the entry is skipped (no shared region on this platform).
+    virtual bool _addRegionsToArray(RKRegionWalkState& state, uint64_t start, uint64_t size,
+                                    const RKRegionSubmapInfo& info);
+    // Charges a tag-named region from the owned-object list. Not yet: nothing changes.
+    virtual void _chargeOwnedObjectForRegion(RKMemoryRegion& region, const RKRegionSubmapInfo& info,
+                                             int purgeState, RKRegionWalkState& state);
+    // Appends a region for every owned object the walk did not meet. Not yet: none.
+    virtual void _addUnconsumedOwnedObjectRegions(RKRegionWalkState& state);
 
     RKTask* task() const { return task_.get(); }
     uint64_t sharedRegionBase() const { return sharedRegionBase_; }
@@ -69,4 +130,22 @@ protected:
     uint64_t phys_memspread_peak_ = 0;
     uint64_t ledgers_ = 0;
     std::optional<RKImageList> images_;  // exists from construction to the end of the walk
+    std::optional<RKOwnedVmObjectMap> ownedVmObjects_;  // from gatherData to the end of the walk
+
+private:
+    // The callback of _gatherMemoryData for one walked entry.
+    bool _addRegionForEntry(RKRegionWalkState& state, uint64_t start, uint64_t size,
+                            const RKRegionSubmapInfo& info, int purgeState,
+                            const std::optional<std::string>& path, const std::optional<std::string>& name,
+                            bool verbose);
+    void _setRegionSizes(RKMemoryRegion& region, const RKRegionSubmapInfo& info, int purgeState,
+                         bool breakDown) const;
+    void _nameRegion(RKMemoryRegion& region, const RKRegionSubmapInfo& info, int purgeState,
+                     const std::optional<std::string>& path, const std::optional<std::string>& name,
+                     RKRegionWalkState& state);
+    void _reconcileUnmappedOwnedRegion(RKRegionWalkState& state);
+    void _addPageTableRegion(RKRegionWalkState& state) const;
+    // One pass of the walk from `address`; false ends the walk. Advances `address`.
+    bool _walkStep(uint64_t& address, uint64_t lastBelowSharedRegion, bool& pseudoRegionSeen,
+                   const RKRegionCallback& callback);
 };
