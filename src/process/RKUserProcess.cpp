@@ -5,6 +5,7 @@
 #include <cstring>
 
 #include "model/RKAssert.h"
+#include "model/RKAuxData.h"
 
 namespace {
 
@@ -129,4 +130,13 @@ void RKUserProcess::_setIdleExitStatusFromDirtyFlags(uint32_t flags) {
         setIdleExitStatus(1);
     else
         setIdleExitStatus((flags & PROC_DIRTY_IS_DIRTY) ? 3 : 2);
+}
+
+std::shared_ptr<RKAuxDataMap> RKUserProcess::auxData() const {
+    if (phys_memspread_ == 0) return nullptr;
+    auto map = std::make_shared<RKAuxDataMap>();
+    map->setObject("phys_memspread", std::make_shared<RKAuxData>(static_cast<int64_t>(phys_memspread_), false));
+    map->setObject("phys_memspread_peak",
+                   std::make_shared<RKAuxData>(static_cast<int64_t>(phys_memspread_peak_), false));
+    return map;
 }

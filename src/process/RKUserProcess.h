@@ -114,6 +114,10 @@ public:
     uint64_t sharedRegionBase() const { return sharedRegionBase_; }
     uint64_t sharedRegionSize() const { return sharedRegionSize_; }
     uint32_t sharedRegionAlignmentSize() const { return sharedRegionAlignmentSize_; }
+    // The kernel's own memspread figure and its peak, as two leaves that are not summed across
+    // processes; none when the figure could not be read.
+    std::shared_ptr<RKAuxDataMap> auxData() const override;
+
     uint64_t phys_memspread() const { return phys_memspread_; }
     void setPhys_memspread(uint64_t value) { phys_memspread_ = value; }
     uint64_t phys_memspread_peak() const { return phys_memspread_peak_; }
