@@ -4,37 +4,38 @@
 
 #include <memory>
 #include <string>
-#include <vector>
 
-#include "support/RKRecordingFormatter.h"
 #include "analysis/RKMemspread.h"
 #include "model/RKAuxData.h"
 #include "model/RKMemoryRegion.h"
 #include "platform/RKScriptedPlatform.h"
-
-inline constexpr uint64_t kPage = 4096;
+#include "support/RKRecordingFormatter.h"
 
 // A process whose errors, warnings and aux data a test can set.
 class RKTestProcess : public RKProcess {
 public:
     void addError(const std::string& text) { errors_.push_back(text); }
     void addWarning(const std::string& text) { warnings_.push_back(text); }
-    std::shared_ptr<RKAuxDataMap> aux;
-    std::shared_ptr<RKAuxDataMap> auxData() const override { return aux; }
+    int64_t auxMemspread = 0;  // aux data with this "memspread" leaf; none when 0
+    std::shared_ptr<RKAuxDataMap> auxData() const override {
+        if (auxMemspread == 0) return nullptr;
+        return std::make_shared<RKAuxDataMap>(
+            RKAuxDataMap::Entries{{"memspread", std::make_shared<RKAuxData>(auxMemspread, true)}});
+    }
 };
 
 inline std::shared_ptr<RKTestProcess> makeProcess(pid_t pid, RKRegionList regions, bool hidden = false) {
     auto process = std::make_shared<RKTestProcess>();
     process->setPid(pid);
-    process->setPageSize(kPage);
+    process->setPageSize(4096);
     process->setHiddenFromDisplay(hidden);
     process->setMemoryRegions(std::move(regions));
     return process;
 }
 
-// A shared mapping of [offset, offset + size) of `objectId` with `dirty` bytes, the rest clean.
-inline std::shared_ptr<RKMemoryRegion> region(uint64_t objectId, uint64_t offset, uint64_t size, uint64_t dirty,
-                                              const std::string& name = "shared") {
+// A shared mapping, named "shared", of [offset, offset + size) of `objectId` with `dirty` bytes,
+// the rest clean.
+inline std::shared_ptr<RKMemoryRegion> region(uint64_t objectId, uint64_t offset, uint64_t size, uint64_t dirty) {
     auto made = std::make_shared<RKMemoryRegion>();
     made->object_id = objectId;
     made->offset = offset;
@@ -43,16 +44,13 @@ inline std::shared_ptr<RKMemoryRegion> region(uint64_t objectId, uint64_t offset
     made->dirtySize = dirty;
     made->cleanNonSpecSize = size - dirty;
     made->share_mode = SM_SHARED;
-    made->segment = RKSegmentNoImage;
-    made->name = name;
+    made->name = "shared";
     return made;
 }
 
 // Program-wide settings for one test, kept in a scripted platform.
-class ScopedSettings {
-public:
-    explicit ScopedSettings(bool breakDown, bool sharingDisabled = false)
-        : scope_(std::make_shared<RKScriptedPlatform>()) {
+struct ScopedSettings {
+    explicit ScopedSettings(bool breakDown, bool sharingDisabled = false) {
         RKMemspread::setBreakDownPhysMemspread(breakDown);
         RKMemspread::setSharingAnalysisDisabled(sharingDisabled);
     }
@@ -60,22 +58,13 @@ public:
         RKMemspread::setSharingAnalysisDisabled(false);
         RKAnalysisSettings::resetCache();
     }
-
-private:
-    RKScopedPlatform scope_;
+    RKScopedPlatform scope{std::make_shared<RKScriptedPlatform>()};
 };
 
-template <class... Process>
-RKProcessList processList(const std::shared_ptr<Process>&... processes) {
-    return RKProcessList{processes...};
-}
-
 // Analyzes `processes` and prints one report on `formatters`.
-inline std::unique_ptr<RKMemspread> report(RKProcessList processes, const RKOutputFormatterList& formatters,
-                                           bool verbose = false, bool summarize = false) {
-    auto memspread = std::make_unique<RKMemspread>(std::move(processes));
-    memspread->analyzeData();
-    for (const auto& formatter : formatters) memspread->addOutputFormatter(formatter);
-    memspread->printOutputVerbose(verbose, summarize);
-    return memspread;
+inline void report(RKProcessList processes, const RKOutputFormatterList& formatters, bool verbose = false) {
+    RKMemspread memspread(std::move(processes));
+    memspread.analyzeData();
+    for (const auto& formatter : formatters) memspread.addOutputFormatter(formatter);
+    memspread.printOutputVerbose(verbose, false);
 }

@@ -1,272 +1,112 @@
-// Gathering orchestration: every process gathered once on niced workers, the cancel flag read
-// before each process, the early-exit error, the time stamps, the cached breakdown setting,
-// and SIGINT delivered as an event.
+// Gathering orchestration: every process gathered once on niced workers between the stamps,
+// a cancel before gathering and its early-exit error, the cached breakdown setting, and SIGINT
+// delivered as an event.
 #include <gtest/gtest.h>
 
 #include <signal.h>
 #include <sys/resource.h>
-#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <atomic>
-#include <chrono>
-#include <mutex>
-#include <set>
 #include <thread>
 
 #include "analysis/RKCancelSource.h"
 #include "analysis/RKMemspread.h"
-#include "analysis/RKWorkerPool.h"
 #include "platform/RKScriptedPlatform.h"
 
 namespace {
 
-constexpr const char* kEarlyExit = "Memspread exited early due to SIGINT and did not finish gathering all data";
+int ownNiceness() { return ::getpriority(PRIO_PROCESS, static_cast<id_t>(::gettid())); }
 
-// A process whose gathering is a hook the test sets; it marks itself gathered with no regions.
-class RKHookProcess : public RKProcess {
-public:
-    std::function<void()> hook;
-    std::atomic<int> gathered{0};
+// A process whose gathering only records how often, how niced and between which stamps it ran.
+struct RKRecordingProcess : RKProcess {
+    int gathered = 0;
     int niceness = 0;
-    std::thread::id thread;
-
+    size_t stampsBefore = 0;
     void gatherData() override {
         gathered++;
-        errno = 0;
-        niceness = ::getpriority(PRIO_PROCESS, static_cast<id_t>(::syscall(SYS_gettid)));
-        thread = std::this_thread::get_id();
-        if (hook) hook();
-        setMemoryRegions(RKRegionList{});
+        niceness = ownNiceness();
+        stampsBefore = dynamic_cast<RKScriptedPlatform&>(RKPlatform::current()).callCount("getTimes");
     }
 };
 
-std::vector<std::shared_ptr<RKHookProcess>> makeProcesses(std::initializer_list<pid_t> pids) {
-    std::vector<std::shared_ptr<RKHookProcess>> processes;
-    for (pid_t pid : pids) {
-        processes.push_back(std::make_shared<RKHookProcess>());
-        processes.back()->setPid(pid);
-    }
-    return processes;
-}
-
-RKProcessList asList(const std::vector<std::shared_ptr<RKHookProcess>>& processes) {
-    return RKProcessList(processes.begin(), processes.end());
-}
-
-// Installs a scripted platform whose clock advances on every reading.
-struct GatherPlatform {
+// Processes of `pids` under a scripted platform.
+struct Gathering {
     std::shared_ptr<RKScriptedPlatform> platform = std::make_shared<RKScriptedPlatform>();
     RKScopedPlatform scope{platform};
-    GatherPlatform() {
-        platform->clocks.absolute = 1000;
-        platform->clocks.continuous = 2000;
-        RKAnalysisSettings::resetCache();
+    std::vector<std::shared_ptr<RKRecordingProcess>> processes;
+    explicit Gathering(const std::vector<pid_t>& pids) {
+        for (pid_t pid : pids) {
+            processes.push_back(std::make_shared<RKRecordingProcess>());
+            processes.back()->setPid(pid);
+        }
     }
-    ~GatherPlatform() { RKAnalysisSettings::resetCache(); }
 };
-
-int ownNiceness() {
-    errno = 0;
-    return ::getpriority(PRIO_PROCESS, static_cast<id_t>(::syscall(SYS_gettid)));
-}
 
 }  // namespace
 
-TEST(RKGather, CancelBeforeGatheringGathersNothingAndFlagsTheLowestPid) {
-    GatherPlatform scripted;
-    auto processes = makeProcesses({300, 5, 4000});
-    RKMemspread memspread(asList(processes));
+TEST(RKGather, ACancelBeforeGatheringGathersNothingAndFlagsTheLowestPid) {
+    Gathering g({300, 5, 4000});
+    RKMemspread memspread({g.processes.begin(), g.processes.end()});
     memspread.cancel();
     EXPECT_TRUE(memspread.gatherData());
-    for (const auto& process : processes) {
-        EXPECT_EQ(process->gathered, 0);
-        EXPECT_FALSE(process->memoryRegions());
-    }
-    EXPECT_EQ(processes[1]->globalErrors(), std::vector<std::string>{kEarlyExit});
-    EXPECT_TRUE(processes[0]->globalErrors().empty());
-    EXPECT_TRUE(processes[2]->globalErrors().empty());
-    EXPECT_TRUE(memspread.gatherStartTime() && memspread.gatherEndTime());
-    EXPECT_EQ(memspread.processes()[0]->pid(), 300);  // the given order is kept
-}
-
-TEST(RKGather, AnEmptyListGathersNothingButIsStamped) {
-    GatherPlatform scripted;
-    RKMemspread memspread({});
-    EXPECT_FALSE(memspread.gatherData());
-    ASSERT_TRUE(memspread.gatherStartTime());
-    ASSERT_TRUE(memspread.gatherEndTime());
-    EXPECT_EQ(scripted.platform->callCount("getTimes"), 2u);
+    for (const auto& process : g.processes) EXPECT_EQ(process->gathered, 0);
+    EXPECT_TRUE(g.processes[0]->globalErrors().empty() && g.processes[2]->globalErrors().empty());
+    EXPECT_EQ(g.processes[1]->globalErrors(),
+              std::vector<std::string>{"Memspread exited early due to SIGINT and did not finish gathering all data"});
+    // An empty list gathers nothing, is not cancelled, and is stamped all the same.
+    RKMemspread none({});
+    EXPECT_FALSE(none.gatherData());
+    EXPECT_TRUE(none.gatherStartTime() && none.gatherEndTime());
 }
 
 TEST(RKGather, EveryProcessIsGatheredOnceOnNicedWorkersBetweenTheStamps) {
-    GatherPlatform scripted;
-    std::vector<std::shared_ptr<RKHookProcess>> processes;
-    for (pid_t pid = 1; pid <= 40; pid++) processes.push_back(makeProcesses({pid * 7 % 41})[0]);
-    // Each gathering moves the clock on, so the end stamp must come after all of them.
-    std::mutex clockMutex;
-    for (auto& process : processes)
-        process->hook = [&] {
-            std::lock_guard<std::mutex> lock(clockMutex);
-            scripted.platform->clocks.absolute += 10;
-            scripted.platform->clocks.continuous += 10;
-        };
-    RKMemspread memspread(asList(processes));
-    ASSERT_EQ(memspread.qualityOfService(), QOS_CLASS_UTILITY);
+    Gathering g({1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11, 12, 13, 14, 15, 16});
+    // Of utility quality of service unless told otherwise.
+    RKMemspread memspread({g.processes.begin(), g.processes.end()});
     EXPECT_FALSE(memspread.gatherData());
-    std::set<std::thread::id> threads;
-    for (const auto& process : processes) {
+    for (const auto& process : g.processes) {
         EXPECT_EQ(process->gathered, 1);
-        EXPECT_TRUE(process->memoryRegions());
-        EXPECT_TRUE(process->globalErrors().empty());
-        EXPECT_EQ(process->niceness, std::min(ownNiceness() + 5, 19));
-        EXPECT_NE(process->thread, std::this_thread::get_id());
-        threads.insert(process->thread);
+        EXPECT_EQ(process->stampsBefore, 1u) << "not gathered between the start and the end stamp";
+        EXPECT_EQ(process->niceness, std::min(ownNiceness() + 5, 19)) << "not on a worker niced by 5";
     }
-    EXPECT_LE(threads.size(), RKOnlineCpuCount());
-    EXPECT_EQ(memspread.gatherStartTime()->machAbsoluteTime(), 1000u);
-    EXPECT_EQ(memspread.gatherEndTime()->machAbsoluteTime(), 1000u + 40 * 10);
-
     // User-initiated gathering runs at the caller's own priority.
-    auto again = makeProcesses({10, 20});
-    RKMemspread sampling(asList(again));
+    RKMemspread sampling({g.processes[0]});
     sampling.setQualityOfService(QOS_CLASS_USER_INITIATED);
     sampling.gatherData();
-    EXPECT_EQ(again[0]->niceness, ownNiceness());
-}
-
-// A cancel while gathering: the processes already started finish, later ones are skipped.
-TEST(RKGather, CancelDuringGatheringSkipsTheProcessesNotYetStarted) {
-    GatherPlatform scripted;
-    size_t workers = RKOnlineCpuCount();
-    std::vector<std::shared_ptr<RKHookProcess>> processes;
-    for (size_t i = 0; i < workers + 5; i++) processes.push_back(makeProcesses({static_cast<pid_t>(100 + i)})[0]);
-    RKMemspread memspread(asList(processes));
-    std::atomic<bool> cancelled{false};
-    auto& highest = processes.back();
-    highest->hook = [&] {
-        memspread.cancel();
-        cancelled = true;
-    };
-    // The others stay busy until the cancel, so at most one per worker can have started.
-    for (auto& process : processes)
-        if (process != highest)
-            process->hook = [&] {
-                auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-                while (!cancelled && std::chrono::steady_clock::now() < deadline) std::this_thread::yield();
-            };
-    EXPECT_TRUE(memspread.gatherData());
-    size_t gathered = 0;
-    for (const auto& process : processes) {
-        gathered += process->gathered;
-        EXPECT_EQ(process->gathered > 0, process->memoryRegions().has_value());
-    }
-    EXPECT_EQ(highest->gathered, 1);
-    EXPECT_LE(gathered, workers);
-    EXPECT_EQ(processes.front()->gathered, 0);
-    EXPECT_EQ(processes.front()->globalErrors(), std::vector<std::string>{kEarlyExit});
+    EXPECT_EQ(g.processes[0]->niceness, ownNiceness());
 }
 
 TEST(RKGather, TheBreakdownSettingIsAskedOnceUntilItIsSet) {
-    GatherPlatform scripted;
-    EXPECT_FALSE(RKMemspread::breakDownPhysMemspread());
-    EXPECT_FALSE(RKMemspread::breakDownPhysMemspread());
-    EXPECT_EQ(scripted.platform->callCount("readSelfRegionMemspread"), 1u);
-    RKMemspread::setBreakDownPhysMemspread(true);
-    EXPECT_EQ(scripted.platform->selfRegionValue, 1);
-    EXPECT_TRUE(RKMemspread::breakDownPhysMemspread());
-    EXPECT_TRUE(RKMemspread::breakDownPhysMemspread());
-    EXPECT_EQ(scripted.platform->callCount("readSelfRegionMemspread"), 2u);
-
-    // A kernel without the setting reads as off and says nothing; other failures say why.
-    RKMemspread::setBreakDownPhysMemspread(false);
-    scripted.platform->selfRegionValue = 1;
-    scripted.platform->selfRegionReadErrno = ENOENT;
-    testing::internal::CaptureStderr();
-    EXPECT_FALSE(RKMemspread::breakDownPhysMemspread());
-    EXPECT_EQ(testing::internal::GetCapturedStderr(), "");
+    Gathering g({});
     RKAnalysisSettings::resetCache();
-    scripted.platform->selfRegionReadErrno = EPERM;
-    testing::internal::CaptureStderr();
     EXPECT_FALSE(RKMemspread::breakDownPhysMemspread());
-    EXPECT_EQ(testing::internal::GetCapturedStderr(),
-              std::string("Unable to retrieve status of physical memspread data collection: ") + strerror(EPERM) +
-                  "\n");
-    scripted.platform->selfRegionWriteErrno = EPERM;
-    testing::internal::CaptureStderr();
+    EXPECT_FALSE(RKMemspread::breakDownPhysMemspread());
     RKMemspread::setBreakDownPhysMemspread(true);
-    EXPECT_EQ(testing::internal::GetCapturedStderr(),
-              std::string("Unable to configure physical memspread data collection: ") + strerror(EPERM) + "\n");
+    EXPECT_TRUE(RKMemspread::breakDownPhysMemspread());
+    EXPECT_EQ(g.platform->callCount("readSelfRegionMemspread"), 2u) << "asked once, then once more after the change";
+    RKAnalysisSettings::resetCache();
 }
 
-namespace {
-
-bool waitFor(const std::atomic<int>& counter, int value) {
-    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-    while (counter < value && std::chrono::steady_clock::now() < deadline)
-        std::this_thread::sleep_for(std::chrono::milliseconds(1));
-    return counter >= value;
-}
-
-bool sigintBlockedHere() {
+// SIGINT is ignored and comes to the handler as an event, once per signal, until the source
+// goes; then SIGINT has its default action back and is no longer blocked.
+TEST(RKCancelSource, EachSigintCallsTheHandlerUntilTheSourceGoes) {
+    std::atomic<int> calls{0};
+    auto source = RKMemspread::installCancelHandler([&] { calls++; });
+    ASSERT_TRUE(source);
+    struct sigaction action {};
+    sigaction(SIGINT, nullptr, &action);
+    EXPECT_EQ(action.sa_handler, SIG_IGN) << "a signal handler, not an event";
+    for (int sent = 1; sent <= 2; sent++) {
+        ASSERT_EQ(::kill(::getpid(), SIGINT), 0);
+        for (int waited = 0; calls < sent && waited < 10000; waited++)
+            std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    }
+    EXPECT_EQ(calls, 2);
+    source.reset();
+    sigaction(SIGINT, nullptr, &action);
+    EXPECT_EQ(action.sa_handler, SIG_DFL);
     sigset_t mask;
     pthread_sigmask(SIG_BLOCK, nullptr, &mask);
-    return sigismember(&mask, SIGINT) == 1;
-}
-
-}  // namespace
-
-TEST(RKCancelSource, EachSigintCallsTheHandlerOnItsOwnThreadUntilCancelled) {
-    ASSERT_FALSE(sigintBlockedHere());
-    std::atomic<int> calls{0};
-    std::thread::id handlerThread;
-    auto source = RKMemspread::installCancelHandler([&] {
-        handlerThread = std::this_thread::get_id();
-        calls++;
-    });
-    ASSERT_TRUE(source);
-    struct sigaction action {};
-    sigaction(SIGINT, nullptr, &action);
-    EXPECT_EQ(action.sa_handler, SIG_IGN);
-
-    ASSERT_EQ(::kill(::getpid(), SIGINT), 0);
-    ASSERT_TRUE(waitFor(calls, 1));
-    ASSERT_EQ(::kill(::getpid(), SIGINT), 0);  // a second SIGINT calls it again
-    ASSERT_TRUE(waitFor(calls, 2));
-    EXPECT_NE(handlerThread, std::this_thread::get_id());
-
-    source.reset();  // cancelled: default action back, SIGINT no longer blocked here
-    sigaction(SIGINT, nullptr, &action);
-    EXPECT_EQ(action.sa_handler, SIG_DFL);
-    EXPECT_FALSE(sigintBlockedHere());
-    EXPECT_EQ(calls, 2);
-}
-
-TEST(RKCancelSource, AHandlerMayCancelItsOwnSource) {
-    std::atomic<int> calls{0};
-    std::unique_ptr<RKCancelSource> source;
-    std::mutex sourceMutex;
-    {
-        std::lock_guard<std::mutex> lock(sourceMutex);
-        source = RKCancelSource::install([&] {
-            std::lock_guard<std::mutex> lock(sourceMutex);
-            source->cancel();
-            calls++;
-        });
-    }
-    ASSERT_TRUE(source);
-    ASSERT_EQ(::kill(::getpid(), SIGINT), 0);
-    ASSERT_TRUE(waitFor(calls, 1));
-    std::lock_guard<std::mutex> lock(sourceMutex);
-    EXPECT_TRUE(source->isCancelled());
-    struct sigaction action {};
-    sigaction(SIGINT, nullptr, &action);
-    EXPECT_EQ(action.sa_handler, SIG_DFL);
-    // Cancelled on another thread than the installer's: SIGINT stays blocked here until the
-    // installer unblocks it.
-    EXPECT_TRUE(sigintBlockedHere());
-    sigset_t set;
-    sigemptyset(&set);
-    sigaddset(&set, SIGINT);
-    pthread_sigmask(SIG_UNBLOCK, &set, nullptr);
+    EXPECT_EQ(sigismember(&mask, SIGINT), 0);
 }

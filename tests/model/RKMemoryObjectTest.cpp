@@ -1,19 +1,71 @@
+// Memory objects, the regions that map them and the groups of processes that share them.
 #include "model/RKMemoryObject.h"
 
 #include <gtest/gtest.h>
 
-#include "RKModelTestSupport.h"
+#include <array>
+#include <unordered_set>
+#include <vector>
+
+#include "model/RKMemoryRegion.h"
+#include "model/RKProcessGroup.h"
+#include "platform/RKScriptedPlatform.h"
+#include "process/RKAnalysisSettings.h"
 
 namespace {
 
+constexpr uint64_t kPage = 4096;
+
+std::shared_ptr<RKProcess> makeProcess(pid_t pid) {
+    auto process = std::make_shared<RKProcess>();
+    process->setPid(pid);
+    process->setPageSize(kPage);
+    return process;
+}
+
+struct RegionSizes {
+    uint64_t dirty = 0, swapped = 0, clean = 0, reclaimable = 0;
+    bool wired = false;
+};
+
+// A shared mapping (eligible for per-process views) of the first `size` bytes of an object.
+std::shared_ptr<RKMemoryRegion> region(RegionSizes sizes, uint64_t size = 4 * kPage, uint64_t objectId = 7) {
+    auto made = std::make_shared<RKMemoryRegion>();
+    made->object_id = objectId;
+    made->size = size;
+    made->share_mode = SM_SHARED;
+    made->dirtySize = sizes.dirty;
+    made->swappedSize = sizes.swapped;
+    made->cleanNonSpecSize = sizes.clean;
+    made->reclaimableSize = sizes.reclaimable;
+    made->wired = sizes.wired;
+    return made;
+}
+
 using Totals = std::array<uint64_t, 5>;  // dirty, swapped, clean, reclaimable, wired
+Totals totalsOf(const RKMemoryObject& object) {
+    return {object.totalDirtySize(), object.totalSwappedSize(), object.totalCleanSize(),
+            object.totalReclaimableSize(), object.totalWiredSize()};
+}
+
+// The owned-memory breakdown setting, kept in a scripted platform for one scope.
+struct ScopedBreakdown {
+    explicit ScopedBreakdown(bool on) { RKAnalysisSettings::setBreakDownPhysMemspread(on); }
+    ~ScopedBreakdown() { RKAnalysisSettings::resetCache(); }
+    RKScopedPlatform scope{std::make_shared<RKScriptedPlatform>()};
+};
+
+using Mapping = std::pair<std::shared_ptr<RKProcess>, std::shared_ptr<RKMemoryRegion>>;
 
 class RKMemoryObjectTest : public ::testing::Test {
 protected:
-    std::shared_ptr<RKMemoryObject> objectOf(std::initializer_list<std::pair<RKProcess*, RegionSizes>> mappings,
-                                             pid_t owner = -1, uint64_t size = 4 * kPage) {
+    // Each process maps at an address of its own: mappings line up by object offset only.
+    std::shared_ptr<RKMemoryObject> objectFrom(const std::vector<Mapping>& mappings, pid_t owner = -1) {
         auto object = std::make_shared<RKMemoryObject>();
-        for (const auto& [process, sizes] : mappings) object->addRegion(makeRegion(7, 0, size, sizes), *process);
+        for (const auto& [process, mapping] : mappings) {
+            mapping->start += 0x10000000ull * static_cast<uint64_t>(process->pid());
+            object->addRegion(mapping, *process);
+        }
         object->setOwnerPid(owner);
         object->finalize();
         return object;
@@ -25,102 +77,66 @@ protected:
 
 }  // namespace
 
-TEST_F(RKMemoryObjectTest, MappingsThatSeeItWholeShareTheObjectAsTheirView) {
-    auto inA = makeRegion(7, 0, 2 * kPage, {.dirty = 2 * kPage}), inB = makeRegion(7, 0, 2 * kPage, {.dirty = 2 * kPage});
-    inA->wired = inB->wired = true;
-    inB->start = 0x7f0000000000;  // another address, the same object offsets
-    auto object = std::make_shared<RKMemoryObject>();
-    object->addRegion(inA, *a);
-    object->addRegion(inB, *b);
-    object->finalize();
-    EXPECT_EQ(totalsOf(*object), (Totals{2 * kPage, 0, 0, 0, 2 * kPage}));  // counted once
-    EXPECT_EQ(object->memoryRegions().size(), 2u);
-    EXPECT_FALSE(object->processMemoryRegions());
-    EXPECT_FALSE(object->couldHaveProcessView());
-    EXPECT_EQ(object->viewForProcess(*b), object);
+// Memory two processes reach through one object counts once; each keeps a view of its own only
+// when some mapper does not see the whole object through a single region.
+TEST_F(RKMemoryObjectTest, MappersShareTheObjectUnlessOneSeesLessThanTheWhole) {
+    RegionSizes whole{.dirty = kPage, .wired = true};
+    auto same = objectFrom({{a, region(whole, kPage)}, {b, region(whole, kPage)}});
+    EXPECT_EQ(totalsOf(*same), (Totals{kPage, 0, 0, 0, kPage}));
+    EXPECT_EQ(same->viewForProcess(*b), same);
 
-    auto alone = objectOf({{a.get(), {.dirty = kPage}}, {a.get(), {.clean = kPage}}});
-    EXPECT_FALSE(alone->processMemoryRegions());  // one process never keeps views
-    EXPECT_FALSE(alone->couldHaveProcessView());
-    EXPECT_TRUE(objectOf({{a.get(), {}}}, 10)->couldHaveProcessView());
+    auto half = objectFrom({{a, region({.dirty = 2 * kPage, .clean = 2 * kPage})}, {b, region({.clean = 4 * kPage})}});
+    EXPECT_EQ(totalsOf(*half), (Totals{2 * kPage, 0, 4 * kPage, 0, 0}));
+    EXPECT_EQ(totalsOf(*half->viewForProcess(*a)), (Totals{2 * kPage, 0, 2 * kPage, 0, 0}));
+    EXPECT_EQ(totalsOf(*half->viewForProcess(*b)), (Totals{0, 0, 4 * kPage, 0, 0}));
+    EXPECT_EQ(half->viewForProcess(*c), half);  // not a mapper: the whole object
+
+    // Kept for a mapper with two regions, or one that differs in wired bytes only; never for a
+    // process alone, however it maps the object.
+    EXPECT_TRUE(objectFrom({{a, region({})}, {a, region({})}, {b, region({})}})->processMemoryRegions());
+    EXPECT_TRUE(objectFrom({{a, region({.wired = true})}, {b, region({})}})->processMemoryRegions());
+    EXPECT_FALSE(objectFrom({{a, region({.dirty = kPage})}, {a, region({.clean = kPage})}})->processMemoryRegions());
 }
 
-TEST_F(RKMemoryObjectTest, DifferingMappingsKeepPerProcessViews) {
-    auto object = objectOf({{a.get(), {.dirty = 2 * kPage, .clean = 2 * kPage}}, {b.get(), {.clean = 4 * kPage}}});
-    EXPECT_EQ(totalsOf(*object), (Totals{2 * kPage, 0, 4 * kPage, 0, 0}));
-    ASSERT_TRUE(object->processMemoryRegions());
-    EXPECT_TRUE(object->couldHaveProcessView());
-    EXPECT_EQ(totalsOf(*object->viewForProcess(*a)), (Totals{2 * kPage, 0, 2 * kPage, 0, 0}));
-    EXPECT_EQ(totalsOf(*object->viewForProcess(*b)), (Totals{0, 0, 4 * kPage, 0, 0}));
-    EXPECT_EQ(object->viewForProcess(*a)->memoryRegions().size(), 1u);
-    EXPECT_EQ(object->viewForProcess(*c), object);  // not a mapper: the whole object
-
-    // Each mapper's first region matches the totals, but A maps the object twice.
-    EXPECT_TRUE(objectOf({{a.get(), {.dirty = kPage}}, {a.get(), {.dirty = kPage}}, {b.get(), {.dirty = kPage}}},
-                         -1, kPage)->processMemoryRegions());
-    // B's single region lacks one of the five sizes that A's region and the object have.
-    for (int lacking = 0; lacking < 5; ++lacking) {
-        auto inA = makeRegion(7, 0, 2 * kPage, {kPage, kPage, kPage, kPage}), inB = makeRegion(7, 0, 2 * kPage);
-        inA->wired = true;
-        inB->wired = lacking != 4;
-        uint64_t* sizes[] = {&inB->dirtySize, &inB->swappedSize, &inB->cleanNonSpecSize, &inB->reclaimableSize};
-        for (int i = 0; i < 4; ++i) *sizes[i] = i == lacking ? 0 : kPage;
-        auto object2 = std::make_shared<RKMemoryObject>();
-        object2->addRegion(inA, *a);
-        object2->addRegion(inB, *b);
-        object2->finalize();
-        EXPECT_TRUE(object2->processMemoryRegions()) << lacking;
-    }
-}
-
-TEST_F(RKMemoryObjectTest, TheViewMapStartsAtTheFirstEligibleRegionAndThenTakesAll) {
-    auto object = std::make_shared<RKMemoryObject>();
-    auto first = makeRegion(7, 0, 4 * kPage, {.dirty = 4 * kPage}), last = makeRegion(7, 0, 4 * kPage, {.dirty = kPage});
+// The view map starts with the first eligible (shared) region, then takes every region.
+TEST_F(RKMemoryObjectTest, ViewsStartAtTheFirstSharedMapping) {
+    auto first = region({.dirty = 4 * kPage}), last = region({.dirty = kPage});
     first->share_mode = last->share_mode = SM_PRIVATE;
-    object->addRegion(first, *a);
-    object->addRegion(makeRegion(7, 0, 4 * kPage, {.clean = kPage}), *b);
-    object->addRegion(last, *c);
-    object->finalize();
-    ASSERT_TRUE(object->processMemoryRegions());
-    EXPECT_EQ(object->processMemoryRegions()->count(10), 0u);
+    auto object = objectFrom({{a, first}, {b, region({.clean = kPage})}, {c, last}});
     EXPECT_EQ(object->viewForProcess(*a), object);
     EXPECT_EQ(object->viewForProcess(*c)->totalDirtySize(), kPage);
 }
 
 TEST_F(RKMemoryObjectTest, NonOwnersSeeOwnedDirtyAndSwappedAsClean) {
     RegionSizes owned{.dirty = 2 * kPage, .swapped = kPage, .clean = kPage, .reclaimable = kPage};
-    auto object = objectOf({{a.get(), owned}, {b.get(), owned}}, 10);
+    auto object = objectFrom({{a, region(owned)}, {b, region(owned)}}, 10);
     EXPECT_EQ(object->viewForProcess(*a), object);
-    auto seenByB = object->viewForProcess(*b);
-    EXPECT_EQ(totalsOf(*seenByB), (Totals{0, 0, 4 * kPage, 0, 0}));
-    EXPECT_EQ(&seenByB->memoryRegions(), &object->memoryRegions());  // shared, not duplicated
+    EXPECT_EQ(totalsOf(*object->viewForProcess(*b)), (Totals{0, 0, 4 * kPage, 0, 0}));
 
     // B's own view has one clean page; the whole object's two dirty pages are added to it.
-    auto kept = objectOf({{a.get(), {.dirty = 2 * kPage}}, {b.get(), {.clean = kPage}}}, 10, 2 * kPage);
-    ASSERT_TRUE(kept->processMemoryRegions());
+    auto kept = objectFrom({{a, region({.dirty = 2 * kPage})}, {b, region({.clean = kPage})}}, 10);
     EXPECT_EQ(totalsOf(*kept->viewForProcess(*b)), (Totals{0, 0, 3 * kPage, 0, 0}));
     EXPECT_EQ(kept->viewForProcess(*c), kept);  // outside a kept map: whole, although A owns it
 }
 
-TEST_F(RKMemoryObjectTest, AccountingModes) {
-    // Regions without a VM object are listed but add nothing to the merged ranges.
-    auto noObject = std::make_shared<RKMemoryObject>(), bySums = std::make_shared<RKMemoryObject>();
-    for (auto& object : {noObject, bySums}) {
-        object->addRegion(makeRegion(0, 0, 2 * kPage, {.dirty = 2 * kPage}), *a);
-        object->addRegion(makeRegion(0, 0, kPage, {.swapped = kPage}), *b);
-    }
-    noObject->finalize();
-    bySums->finalizeUsingRegionDirtySize(true);
+TEST_F(RKMemoryObjectTest, SizesMergeBySubrangeAndNeverFromRegionsWithoutAnObject) {
+    // A dirtied the first page and B the second: whole regions merged would count one of them.
+    auto inA = region({.dirty = kPage}), inB = region({.dirty = kPage});
+    inA->addSubrange(0, kPage, RKMemoryTotal{.dirty = kPage}, kPage);
+    inB->addSubrange(kPage, kPage, RKMemoryTotal{.dirty = kPage}, kPage);
+    EXPECT_EQ(objectFrom({{a, inA}, {b, inB}})->totalDirtySize(), 2 * kPage);
+
+    auto noObject = objectFrom({{a, region({.dirty = kPage}, kPage, 0)}, {b, region({}, kPage, 0)}});
     EXPECT_EQ(totalsOf(*noObject), (Totals{0, 0, 0, 0, 0}));
     EXPECT_EQ(noObject->memoryRegions().size(), 2u);
-    EXPECT_EQ(totalsOf(*bySums), (Totals{2 * kPage, kPage, 0, 0, 0}));
 
-    // One page mapped three times: merged once, but with the breakdown on never below what
-    // one process's regions report; a process's view follows its own mode.
+    // One page mapped three times merges once, but with the breakdown on the object never shows
+    // less than one process's own regions report; a process's view follows its mode.
     for (bool on : {false, true}) {
         ScopedBreakdown mode(on);
         RegionSizes page{.dirty = kPage, .swapped = kPage};
-        auto object = objectOf({{a.get(), page}, {a.get(), page}, {a.get(), page}, {b.get(), {.clean = kPage}}}, -1, kPage);
+        auto object = objectFrom({{a, region(page, kPage)}, {a, region(page, kPage)}, {a, region(page, kPage)},
+                                  {b, region({.clean = kPage}, kPage)}});
         uint64_t expected = on ? 3 * kPage : kPage;
         EXPECT_EQ(object->totalDirtySize(), expected) << on;
         EXPECT_EQ(object->totalSwappedSize(), expected) << on;
@@ -128,55 +144,40 @@ TEST_F(RKMemoryObjectTest, AccountingModes) {
     }
 }
 
-TEST_F(RKMemoryObjectTest, SubrangesMergeByObjectOffsetAndAreDropped) {
-    auto inA = makeRegion(7, 0, 4 * kPage, {.dirty = kPage, .clean = kPage});
-    inA->addSubrange(0, kPage, RKMemoryTotal{.dirty = kPage}, kPage);
-    inA->addSubrange(2 * kPage, kPage, RKMemoryTotal{.clean = kPage, .regions = 5}, kPage);
-    auto inB = makeRegion(7, 0, 4 * kPage, {.dirty = kPage, .clean = 3 * kPage});
-    inB->start = 0x5000000;
-    inB->addSubrange(0, kPage, RKMemoryTotal{.dirty = kPage}, kPage);
-    inB->addSubrange(kPage, 3 * kPage, RKMemoryTotal{.clean = 3 * kPage}, kPage);
-    auto object = std::make_shared<RKMemoryObject>();
-    object->addRegion(inA, *a);
-    object->addRegion(inB, *b);
-    EXPECT_EQ(inA->subrangeList(), nullptr);
-    object->finalize();
-    EXPECT_EQ(totalsOf(*object), (Totals{kPage, 0, 3 * kPage, 0, 0}));  // the dirty page once
+// Which mappings may differ between processes (a view of their own) and which are worth
+// splitting into subranges.
+TEST(RKMemoryRegion, EligibilityForProcessViewsAndSubranges) {
+    auto eligible = [](auto&& change) {
+        auto made = region({.dirty = kPage, .clean = kPage});
+        change(*made);
+        return std::pair{made->eligibleForProcessView(), made->eligibleForSubrangesUsingPageSize(kPage)};
+    };
+    using Both = std::pair<bool, bool>;
+    EXPECT_EQ(eligible([](auto&) {}), Both(true, true));
+    EXPECT_EQ(eligible([](auto& r) { r.share_mode = SM_PRIVATE; }), Both(false, false));
+    // Not worth splitting: wholly in one state, one page, owned.
+    EXPECT_EQ(eligible([](auto& r) { r.reclaimableSize = r.size; }), Both(true, false));
+    EXPECT_EQ(eligible([](auto& r) { r.size = kPage; }), Both(true, false));
+    EXPECT_EQ(eligible([](auto& r) { r.ownedExclusivelyByParentProcess = true; }), Both(true, false));
 }
 
-TEST_F(RKMemoryObjectTest, NamesComeFromTheCanonicalRegion) {
-    auto unused = makeRegion(7, 0, kPage, {}, "unused shared lib"), image = makeRegion(7, kPage, kPage, {}, "libfoo.so");
-    unused->inSharedCache = unused->unusedSharedCacheRegion = image->inSharedCache = true;
-    image->detailedName = "/usr/lib/libfoo.so";
-    auto cache = std::make_shared<RKMemoryObject>();
-    cache->addRegion(unused, *a);
-    cache->addRegion(image, *a);
-    EXPECT_EQ(cache->fullName(), "libfoo.so /usr/lib/libfoo.so");
-
-    // Owned but unmapped memory first: with an owner, the mapping names the object and the
-    // fake region; without one, the first region names it.
-    for (pid_t owner : {10, -1}) {
-        auto fake = makeRegion(9, 0, kPage, {}, RKMemoryRegion::categoryNameForTag(RKFakeRegionTag));
-        fake->user_tag = RKFakeRegionTag;
-        auto mapping = makeRegion(9, 0, kPage, {}, "memfd");
-        mapping->detailedName = "buffer";
-        auto object = std::make_shared<RKMemoryObject>();
-        object->addRegion(fake, *a);
-        object->addRegion(mapping, *b);
-        object->setOwnerPid(owner);
-        EXPECT_TRUE(object->containsFakeRegion());
-        object->finalize();
-        std::string expected = owner == -1 ? "Owned physical memspread (unmapped)" : "memfd buffer";
-        EXPECT_EQ(object->fullName(), expected);
-        EXPECT_EQ(fake->fullName(), expected);
-    }
-}
-
-TEST_F(RKMemoryObjectTest, ProgrammingErrorsStop) {
-    auto object = std::make_shared<RKMemoryObject>();
-    object->addRegion(makeRegion(7, 0, kPage), *a);
-    EXPECT_DEATH(object->copy(), "not finalized");
-    object->finalize();
-    EXPECT_DEATH(object->finalize(), "finalized twice");
-    EXPECT_DEATH(object->addRegion(makeRegion(7, 0, kPage), *a), "finalized");
+// The group built for each memory object finds the one interned group of its member set;
+// interned groups are equal only to themselves.
+TEST(RKProcessGroup, MinimalGroupsFindTheirInternedTwinByMemberSet) {
+    auto groupOf = [](std::initializer_list<pid_t> pids) {
+        auto group = std::make_shared<RKProcessGroupMinimal>();
+        for (pid_t pid : pids) group->addProcess(makeProcess(pid));
+        return group;
+    };
+    std::unordered_set<std::shared_ptr<RKProcessGroup>, RKProcessGroupHash, RKProcessGroupEqual> interned;
+    auto group = groupOf({1, 2})->immutableCopy();
+    interned.insert(group);
+    auto twin = groupOf({1, 2});
+    twin->addProcess(makeProcess(2));  // an equal process is already a member
+    auto found = interned.find(*twin);
+    ASSERT_NE(found, interned.end());
+    EXPECT_EQ(*found, group);
+    EXPECT_TRUE(group->isEqual(*groupOf({2, 1})));
+    EXPECT_EQ(interned.find(*groupOf({1, 2, 3})), interned.end());
+    EXPECT_TRUE(interned.insert(groupOf({1, 2})->immutableCopy()).second);
 }

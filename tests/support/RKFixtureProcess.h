@@ -4,7 +4,6 @@
 
 #include <sys/types.h>
 
-#include <chrono>
 #include <cstdint>
 #include <map>
 #include <optional>
@@ -24,23 +23,19 @@ public:
     RKFixtureProcess& operator=(const RKFixtureProcess&) = delete;
 
     // Runs `binary` with `arguments` and waits until it says "ready". False, with the reason in
-    // error(), when it cannot be started, exits, or is not ready within `timeout`.
-    bool start(const std::string& binary, const std::vector<std::string>& arguments = {},
-               std::chrono::milliseconds timeout = std::chrono::seconds(20));
-    // Closes its standard input and reaps it (killing it when it does not end in time).
-    // Returns its wait status, or nothing when it was not running.
-    std::optional<int> stop(std::chrono::milliseconds timeout = std::chrono::seconds(5));
+    // error(), when it cannot be started, exits, or is not ready within 20 seconds.
+    bool start(const std::string& binary, const std::vector<std::string>& arguments = {});
+    // Closes its standard input and reaps it, killing it when it does not end within 5 seconds.
+    void stop();
 
     pid_t pid() const { return pid_; }
     pid_t childPid() const { return childPid_; }
     // The area the fixture announced under `name`, if it made one.
     std::optional<RKFixtureArea> area(const std::string& name) const;
-    const std::map<std::string, RKFixtureArea>& areas() const { return areas_; }
     const std::string& error() const { return error_; }
 
 private:
-    bool readUntilReady(std::chrono::milliseconds timeout);
-    bool parseLine(const std::string& line);
+    bool readUntilReady();
 
     pid_t pid_ = -1;
     pid_t childPid_ = -1;

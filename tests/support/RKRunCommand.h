@@ -10,25 +10,17 @@
 struct RKCommandResult {
     std::string standardOutput;
     std::string standardError;
-    std::optional<int> exitStatus;     // set when the program exited
-    std::optional<int> terminatingSignal;  // set when a signal ended it
-    bool timedOut = false;             // killed after the timeout
-    bool started = false;              // false when the program could not be spawned
+    std::optional<int> exitStatus;  // set when the program exited (not when a signal ended it)
+    bool started = false;           // false when the program could not be spawned
 
-    bool exitedWith(int status) const { return exitStatus && *exitStatus == status; }
-};
-
-struct RKCommandOptions {
-    std::chrono::milliseconds timeout{std::chrono::seconds(120)};
-    // Sent once the program has run this long (for example SIGINT during a measurement).
-    std::optional<std::chrono::milliseconds> signalAfter;
-    int signal = 0;
+    bool exitedWith(int status) const { return exitStatus == status; }
 };
 
 // Runs argv[0] (searched in PATH when it has no '/') with argv, standard input /dev/null,
 // standard output and standard error captured separately. Never hangs: a program still running
 // at the timeout is killed.
-RKCommandResult RKRunCommand(const std::vector<std::string>& argv, const RKCommandOptions& options = {});
+RKCommandResult RKRunCommand(const std::vector<std::string>& argv,
+                             std::chrono::milliseconds timeout = std::chrono::seconds(120));
 
 // The lines of `text`, each without its "\n"; a final line without "\n" counts too.
 std::vector<std::string> RKSplitLines(const std::string& text);

@@ -1,0 +1,229 @@
+// The binary up to the measurement: what the command line alone decides, what becomes of named
+// output files, and which processes are targeted. Targets are copies of sleep started under names
+// of their own, so that nothing else on the machine answers to them.
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <spawn.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <chrono>
+#include <filesystem>
+#include <fstream>
+#include <set>
+#include <sstream>
+#include <thread>
+
+#include "driver/RKMemspreadArgs.h"
+#include "platform/RKLinuxPlatform.h"
+#include "process/RKKernelProcess.h"
+#include "support/RKRunCommand.h"
+#include "support/RKUnprivileged.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+using Keys = std::set<int64_t>;
+
+const std::string kNoTarget =
+    "Unable to find any processes matching the supplied process names or pids (try as root?)\n";
+
+RKCommandResult memspread(std::vector<std::string> arguments) {
+    arguments.insert(arguments.begin(), MEMSPREAD_BINARY);
+    return RKRunCommand(arguments);
+}
+
+std::string contents(const std::string& path) {
+    std::stringstream text;
+    text << std::ifstream(path).rdbuf();
+    return text.str();
+}
+
+class RKDriverTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        std::string pattern = (fs::temp_directory_path() / "memspread-e2e-XXXXXX").string();
+        ASSERT_NE(mkdtemp(pattern.data()), nullptr);
+        directory_ = pattern;
+    }
+    void TearDown() override {
+        for (pid_t group : groups_) kill(-group, SIGKILL);
+        for (pid_t group : groups_) waitpid(group, nullptr, 0);
+        fs::remove_all(directory_);
+    }
+
+    // A file that already holds something, as a stale report would.
+    std::string existingFile(const std::string& name) {
+        std::string path = (directory_ / name).string();
+        std::ofstream(path) << "stale report\n";
+        return path;
+    }
+
+    // Starts `argv` in a process group of its own; it runs argv[0] by the time this returns.
+    pid_t start(const std::vector<std::string>& argv) {
+        std::vector<char*> pointers;
+        for (const auto& argument : argv) pointers.push_back(const_cast<char*>(argument.c_str()));
+        pointers.push_back(nullptr);
+        posix_spawnattr_t attributes;
+        posix_spawnattr_init(&attributes);
+        posix_spawnattr_setflags(&attributes, POSIX_SPAWN_SETPGROUP);
+        pid_t pid = -1;
+        EXPECT_EQ(posix_spawn(&pid, pointers[0], nullptr, &attributes, pointers.data(), environ), 0) << argv[0];
+        posix_spawnattr_destroy(&attributes);
+        if (pid > 0) groups_.push_back(pid);
+        return pid;
+    }
+
+    // A copy of sleep named by the test run's tag and `suffix` (short: the kernel keeps 15 bytes).
+    std::string sleeper(const std::string& suffix) {
+        fs::path path = directory_ / (tag_ + suffix);
+        if (!fs::exists(path)) fs::copy_file("/bin/sleep", path);
+        return path.string();
+    }
+    pid_t startSleeper(const std::string& suffix) { return start({sleeper(suffix), "300"}); }
+
+    // Resolves a command line (without the program name) in this process, on the real /proc.
+    Keys resolve(std::vector<std::string> arguments, RKError* error = nullptr) {
+        RKScopedPlatform scope(std::make_shared<RKLinuxPlatform>());
+        arguments.insert(arguments.begin(), "memspread");
+        std::vector<char*> argv;
+        for (auto& argument : arguments) argv.push_back(argument.data());
+        argv.push_back(nullptr);
+        auto args = RKMemspreadArgs::initWithArgc(static_cast<int>(arguments.size()), argv.data());
+        Keys keys;
+        for (const auto& [key, process] : args.value().targetProcessesAndError(error).value_or(RKTargetMap{}))
+            if (key != 0 || std::dynamic_pointer_cast<RKKernelProcess>(process)) keys.insert(key);
+        return keys;
+    }
+
+    const std::string tag_ = "rk" + std::to_string(getpid() % 100000);
+    fs::path directory_;
+    std::vector<pid_t> groups_;
+};
+
+}  // namespace
+
+// Runs every command line of the data file and writes down the answers in the file's own form.
+TEST_F(RKDriverTest, WhatTheCommandLineAloneDecides) {
+    const std::string usage = contents(MEMSPREAD_TEST_DATA "/usage.txt");  // as documented
+    std::string expected;
+    std::string actual;
+    for (const std::string& line : RKSplitLines(contents(MEMSPREAD_TEST_DATA "/driver-failures.txt"))) {
+        if (line.empty() || line[0] == '#') continue;
+        expected += line + "\n";
+        if (line[0] != '$') continue;
+        std::istringstream words(line.substr(1));
+        std::vector<std::string> arguments;
+        for (std::string word; words >> word;) arguments.push_back(word);
+        RKCommandResult result = memspread(arguments);
+        actual += line + "\nexit " + std::to_string(result.exitStatus.value_or(-1));
+        actual += result.standardOutput == usage ? " usage\n" : result.standardOutput.empty() ? "\n" : " other\n";
+        if (result.standardError.rfind(MEMSPREAD_BINARY, 0) == 0)
+            result.standardError.replace(0, sizeof MEMSPREAD_BINARY - 1, "memspread");
+        for (const std::string& error : RKSplitLines(result.standardError))
+            actual += (error.empty() ? "|" : "| " + error) + "\n";
+        if (!result.standardError.empty() && result.standardError.back() != '\n') actual += "(no final newline)\n";
+    }
+    EXPECT_EQ(actual, expected);
+}
+
+TEST_F(RKDriverTest, FailedStartRemovesEveryNamedOutputFileAndARunReplacesThem) {
+    std::string json = existingFile("out.json");
+    std::string metrilog = existingFile("out.mlj");
+    EXPECT_TRUE(memspread({"-j", json, "--metrilog", metrilog}).exitedWith(1));
+    EXPECT_FALSE(fs::exists(json));
+    EXPECT_FALSE(fs::exists(metrilog));
+
+    // The JSON file was created before the metrics log failed; it goes too.
+    RKCommandResult badLog = memspread({"-j", json, "--metrilog", directory_ / "missing" / "out.mlj", "1"});
+    EXPECT_TRUE(badLog.exitedWith(1));
+    EXPECT_EQ(badLog.standardError,
+              "Unable to open mlwriter: No such file or directory\nUnable to create metrilog output\n");
+    EXPECT_FALSE(fs::exists(json));
+
+    // One target found is enough to run.
+    existingFile("out.json");
+    RKCommandResult found =
+        memspread({"-j", json, "--metrilog", metrilog, std::to_string(startSleeper("run")), tag_ + "x"});
+    EXPECT_TRUE(found.exitedWith(0)) << found.standardError;
+    EXPECT_EQ(found.standardError, "Unable to find pid for process matching '" + tag_ + "x'\n");
+    EXPECT_EQ(contents(json).substr(0, 1), "{") << "a document replaces the stale report";
+    EXPECT_TRUE(fs::exists(metrilog));
+}
+
+TEST_F(RKDriverTest, NamesFollowTheExecutableAndMatchExactly) {
+    pid_t first = startSleeper("twin");
+    pid_t second = startSleeper("twin");
+    EXPECT_EQ(resolve({tag_ + "twin"}), (Keys{first, second}));
+    EXPECT_EQ(resolve({tag_ + "twi"}), Keys{}) << "no prefix matching";
+    RKError error;
+    EXPECT_EQ(resolve({tag_ + "TWIN"}, &error), Keys{});
+    EXPECT_EQ(error.localizedDescription, "Unable to find pid for process matching '" + tag_ + "TWIN'");
+    EXPECT_EQ(resolve({"0"}), Keys{0});
+    EXPECT_EQ(resolve({"kernel"}), Keys{0});
+
+    pid_t deleted = startSleeper("gone");
+    pid_t renamed = startSleeper("before");
+    pid_t spaced = startSleeper(" a ) b");
+    fs::remove(sleeper("gone"));
+    fs::rename(sleeper("before"), directory_ / (tag_ + "after"));
+    EXPECT_EQ(resolve({tag_ + "gone", tag_ + "after", tag_ + " a ) b"}), (Keys{deleted, renamed, spaced}));
+}
+
+TEST_F(RKDriverTest, ChildrenExclusionsAndSelf) {
+    // shell -> leaf -> leaf: the subshell starts the grandchild, then becomes the child.
+    pid_t root = start({"/bin/sh", "-c", "(\"$0\" 300 & exec \"$0\" 300) & wait", sleeper("leaf")});
+    Keys tree;
+    for (int i = 0; i < 500 && (tree = resolve({tag_ + "leaf"})).size() < 2; i++)
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    ASSERT_EQ(tree.size(), 2u);
+    tree.insert(root);
+    EXPECT_EQ(resolve({"-t", std::to_string(root)}), tree);
+    // -x takes a named target away, but not a descendant that -t brings back.
+    EXPECT_EQ(resolve({tag_ + "leaf", "-x", tag_ + "leaf"}), Keys{});
+    EXPECT_EQ(resolve({"-t", std::to_string(root), "-x", tag_ + "leaf"}), tree);
+
+    // memspread is never its own target: not by pid, and not with -a.
+    EXPECT_EQ(resolve({"--pid", std::to_string(getpid())}), Keys{});
+    Keys all = resolve({"-a"});
+    EXPECT_EQ(all.count(getpid()), 0u);
+    EXPECT_TRUE(std::includes(all.begin(), all.end(), tree.begin(), tree.end()));
+    EXPECT_EQ(all.count(0), 1u);
+
+    // A copy of the binary under a name of its own: nothing but itself answers to it.
+    fs::path self = directory_ / (tag_ + "self");
+    fs::copy_file(MEMSPREAD_BINARY, self);
+    RKCommandResult alone = RKRunCommand({self.string(), self.filename().string()});
+    EXPECT_TRUE(alone.exitedWith(1));
+    EXPECT_EQ(alone.standardError, kNoTarget) << "only the summary, and no usage";
+    EXPECT_EQ(alone.standardOutput, "");
+}
+
+TEST_F(RKDriverTest, AnUnprivilegedUser) {
+    if (geteuid() != 0) GTEST_SKIP() << "needs root to run the binary as nobody";
+    // -a and --unmapped need root; the directory is open to nobody, so that only the binary's own
+    // refusal keeps the stale report as it was.
+    std::string json = existingFile("kept.json");
+    fs::permissions(directory_, fs::perms::all);
+    fs::permissions(json, fs::perms::all);
+    for (const std::vector<std::string>& arguments :
+         {std::vector<std::string>{"-a"}, {"--unmapped", "1"}, {"-a", "-j", json}}) {
+        RKCommandResult result = RKRunCommand(RKCommandAsNobody(arguments));
+        EXPECT_TRUE(result.exitedWith(1)) << arguments.front();
+        EXPECT_EQ(result.standardError, "Must run as root.\n") << arguments.front();
+        EXPECT_EQ(result.standardOutput, "") << arguments.front();
+    }
+    EXPECT_EQ(contents(json), "stale report\n");
+
+    // Another user's process is left out; without access to its executable its name comes from
+    // the kernel's record.
+    std::string pid = std::to_string(startSleeper("root"));
+    RKCommandResult byPid = RKRunCommand(RKCommandAsNobody({pid}));
+    EXPECT_TRUE(byPid.exitedWith(1));
+    EXPECT_EQ(byPid.standardError, "task_for_pid: permission denied\nUnable to analyze process with pid " + pid +
+                                       " (try as root?)\n" + kNoTarget);
+    RKCommandResult byName = RKRunCommand(RKCommandAsNobody({tag_ + "root"}));
+    EXPECT_EQ(byName.standardError, "task_for_pid: permission denied\nUnable to analyze process " + tag_ + "root [" +
+                                        pid + "] (try as root?)\n" + kNoTarget);
+}
