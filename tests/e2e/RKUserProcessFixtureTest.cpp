@@ -30,7 +30,8 @@ const RKMemoryRegion& regionAt(const RKProcess& process, const RKFixtureProcess&
 
 // The Dirty column by category of the table that follows the first `heading` at or after `from`
 // in a report in bytes.
-std::map<std::string, uint64_t> dirtyByCategory(const std::string& report, const std::string& heading, size_t from = 0) {
+std::map<std::string, uint64_t> dirtyByCategory(const std::string& report, const std::string& heading,
+                                                size_t from = 0) {
     static const std::regex row(R"(^ *(\d+) B +\d+ B +\d+ B +\d+    (.+)$)");
     std::map<std::string, uint64_t> rows;
     for (const std::string& line : RKSplitLines(report.substr(std::min(report.find(heading, from), report.size())))) {
