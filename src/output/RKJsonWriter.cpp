@@ -113,7 +113,8 @@ void RKJsonWriter::stringValue(std::string_view text) {
     _endValue();
 }
 
-void RKJsonWriter::signedValue(int64_t value) {
+template <typename Integer>
+void RKJsonWriter::_integerValue(Integer value) {
     _beginValue();
     char digits[24];
     auto result = std::to_chars(digits, digits + sizeof digits, value);
@@ -121,13 +122,9 @@ void RKJsonWriter::signedValue(int64_t value) {
     _endValue();
 }
 
-void RKJsonWriter::unsignedValue(uint64_t value) {
-    _beginValue();
-    char digits[24];
-    auto result = std::to_chars(digits, digits + sizeof digits, value);
-    buffer_.append(digits, result.ptr);
-    _endValue();
-}
+void RKJsonWriter::signedValue(int64_t value) { _integerValue(value); }
+
+void RKJsonWriter::unsignedValue(uint64_t value) { _integerValue(value); }
 
 void RKJsonWriter::secondsValue(double seconds) {
     _beginValue();

@@ -50,6 +50,8 @@ private:
     void _close(char bracket);
     void _beginValue();
     void _endValue();
+    template <typename Integer>
+    void _integerValue(Integer value);
     void _flushIfFull();
     void _flush();
 
