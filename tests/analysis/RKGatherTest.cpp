@@ -60,6 +60,32 @@ TEST(RKGather, ACancelBeforeGatheringGathersNothingAndFlagsTheLowestPid) {
     EXPECT_TRUE(none.gatherStartTime() && none.gatherEndTime());
 }
 
+// A cancel during gathering lets the processes already started finish and skips the rest.
+TEST(RKGather, ACancelDuringGatheringSkipsTheProcessesNotYetStarted) {
+    std::vector<pid_t> pids;
+    for (pid_t pid = 1; pid <= 200; pid++) pids.push_back(pid);
+    Gathering g(pids);
+    struct Canceller : RKRecordingProcess {
+        RKMemspread* memspread = nullptr;
+        void gatherData() override {
+            RKRecordingProcess::gatherData();
+            memspread->cancel();
+        }
+    };
+    auto canceller = std::make_shared<Canceller>();
+    canceller->setPid(1000);  // the highest pid, so the first taken up
+    RKProcessList all(g.processes.begin(), g.processes.end());
+    all.push_back(canceller);
+    RKMemspread memspread(all);
+    canceller->memspread = &memspread;
+    EXPECT_TRUE(memspread.gatherData());
+    EXPECT_EQ(canceller->gathered, 1);
+    int gathered = 0;
+    for (const auto& process : g.processes) gathered += process->gathered;
+    EXPECT_LT(gathered, 200) << "processes were still taken up after the cancel";
+    EXPECT_FALSE(g.processes[0]->globalErrors().empty()) << "the lowest pid carries the early-exit error";
+}
+
 TEST(RKGather, EveryProcessIsGatheredOnceOnNicedWorkersBetweenTheStamps) {
     Gathering g({1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11, 12, 13, 14, 15, 16});
     // Of utility quality of service unless told otherwise.
