@@ -1,7 +1,6 @@
 #include "driver/RKMemspreadArgs.h"
 
 #include <getopt.h>
-#include <strings.h>
 
 #include <cctype>
 #include <charconv>
@@ -10,6 +9,8 @@
 #include <cstdlib>
 #include <cstring>
 #include <string_view>
+
+#include "output/RKTextCategorySort.h"
 
 namespace {
 
@@ -26,12 +27,6 @@ enum : int {
 };
 
 constexpr const char* kShortOptions = "aj:htp:x:svf:yw";
-
-std::string lowercased(std::string_view text) {
-    std::string result(text);
-    for (char& c : result) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
-    return result;
-}
 
 std::string formatted(const char* format, const char* argument) {
     int length = std::snprintf(nullptr, 0, format, argument);
@@ -157,17 +152,14 @@ bool RKMemspreadArgs::_applyOption(int option, const char* argument, RKError* er
         }
         break;
     case kOptionSort: {
-        for (std::string_view column : RKTextSortColumns) {
-            if (column.size() == std::strlen(argument) &&
-                strncasecmp(column.data(), argument, column.size()) == 0) {
-                textSort_ = column;
-                return true;
-            }
+        if (auto column = RKTextSortColumnNamed(argument)) {
+            textSort_ = RKTextSortColumns[static_cast<size_t>(*column)];
+            return true;
         }
         std::string accepted;
         for (std::string_view column : RKTextSortColumns) {
             if (!accepted.empty()) accepted += ", ";
-            accepted += lowercased(column);
+            accepted += RKTextSortColumnArgument(column);
         }
         RKError::set(error, RKMemspreadErrorDomain, RKMemspreadErrorSort,
                      formatted("Unrecognized argument '%s' to --sort.\nAccepted arguments: ", argument) +

@@ -1,4 +1,3 @@
-#include <cctype>
 #include <string>
 
 #include "driver/RKMemspreadArgs.h"
@@ -25,8 +24,7 @@ void printUsage(FILE* out) {
                "    -f, --format (bytes|formatted|pages)  change size formatting preference "
                "(default: formatted)\n",
                out);
-    std::string defaultSort(RKTextSortColumns.front());
-    for (char& c : defaultSort) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
+    std::string defaultSort = RKTextSortColumnArgument(RKTextSortColumns.front());
     std::fprintf(out, "    --sort <column>                       change the column used for sorting (default: %s)\n",
                  defaultSort.c_str());
     std::fputs("    -w, --wide                            show wide output with all columns and full paths "

@@ -3,7 +3,9 @@
 #pragma once
 
 #include <array>
+#include <cctype>
 #include <cstdint>
+#include <string>
 #include <string_view>
 
 enum RKSummaryFormat : int64_t {
@@ -23,3 +25,10 @@ enum RKTextOption : int64_t {
 inline constexpr std::array<std::string_view, 7> RKTextSortColumns = {
     "Dirty", "Swapped", "Clean", "Reclaimable", "Wired", "Regions", "Category",
 };
+
+// A column's name as the command line shows it: in lower case.
+inline std::string RKTextSortColumnArgument(std::string_view column) {
+    std::string result(column);
+    for (char& c : result) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
+    return result;
+}
