@@ -10,7 +10,7 @@ install_missing_packages
 run_suite() {
     local dir=$1
     shift
-    build_tree "$dir" -DMEMSPREAD_TESTS=ON "$@"
+    build_tree "$dir" -DMEMSPREAD_TESTS=ON -DMEMSPREAD_WERROR=ON "$@"
     (cd "$dir" && ctest --output-on-failure -j 2 --timeout 600)
 }
 
