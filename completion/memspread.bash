@@ -41,11 +41,12 @@ _memspread_pids()
     done
 }
 
-# Adds to COMPREPLY the lines of standard input that start with $1, once each, quoted for the
-# shell.
+# Adds to COMPREPLY the lines of standard input that start with the word $1 (as typed, quotes
+# and backslashes included), once each, quoted for the shell.
 _memspread_add_matching()
 {
     local prefix=$1 word quoted
+    [[ $prefix == *[\\\'\"]* ]] && prefix=$(dequote "$prefix")
     local -A seen=()
     while IFS= read -r word; do
         [[ -n $word && $word == "$prefix"* && -z ${seen["$word"]-} ]] || continue
