@@ -6,8 +6,8 @@ include(GNUInstallDirs)
 
 install(TARGETS memspread RUNTIME DESTINATION ${CMAKE_INSTALL_BINDIR})
 
-# Every page in man/ whose command is built. A page is compressed with gzip -n, so that its bytes
-# do not depend on the time of the build.
+# The pages of man/, compressed with gzip -n, so that their bytes do not depend on the time of the
+# build. vmsnap's page is installed with its command, below.
 find_program(MEMSPREAD_GZIP gzip REQUIRED)
 set(memspread_man_pages)
 foreach(command memspread vmsnap)

@@ -1,7 +1,9 @@
 # Shared by run.sh and test.sh: install what the build needs, then configure and build.
 
-memspread_packages=(cmake g++ make libbsd-dev libgtest-dev libgmock-dev libbenchmark-dev util-linux python3
-    dpkg-dev file groff-base bash-completion)
+memspread_packages=(cmake g++ make libbsd-dev libgtest-dev libgmock-dev libbenchmark-dev util-linux python3)
+# The Debian package (dpkg-shlibdeps; CPack's DEB generator runs file) and the checks of the man
+# page and the bash completion.
+memspread_packages+=(dpkg-dev file groff-base bash-completion)
 
 # Installs the packages that are missing. apt-get runs only when something is missing, so a
 # prepared machine builds without network or root.
