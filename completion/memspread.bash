@@ -7,38 +7,38 @@
 # that a server with many thousands of processes completes at once.
 _memspread_process_names()
 {
-    local dir link line rest
-    local -a fields
+    local dir link stat_line rest
     echo kernel
     while IFS=$'\t' read -r dir link; do
         if [[ -n $link ]]; then
             link=${link% (deleted)}
             printf '%s\n' "${link##*/}"
-            continue
+        elif _memspread_read_stat "$dir"; then
+            rest=${stat_line#*"("}
+            printf '%s\n' "${rest%")"*}"
         fi
-        read -r line 2>/dev/null <"$dir/stat" || continue
-        rest=${line##*") "}
-        read -ra fields <<<"$rest"
-        # The seventh field after the name holds the flags; 0x00200000 is PF_KTHREAD.
-        ((${fields[6]:-0} & 0x00200000)) && continue
-        rest=${line#*"("}
-        printf '%s\n' "${rest%")"*}"
     done < <(find /proc/[0-9]*/exe -maxdepth 0 -printf '%h\t%l\n' 2>/dev/null)
 }
 
 # Pids of the processes memspread can measure, and 0 for the kernel.
 _memspread_pids()
 {
-    local dir line rest
-    local -a fields
+    local dir stat_line
     echo 0
     for dir in /proc/[0-9]*; do
-        read -r line 2>/dev/null <"$dir/stat" || continue
-        rest=${line##*") "}
-        read -ra fields <<<"$rest"
-        ((${fields[6]:-0} & 0x00200000)) && continue
-        printf '%s\n' "${dir#/proc/}"
+        _memspread_read_stat "$dir" && printf '%s\n' "${dir#/proc/}"
     done
+}
+
+# Reads the stat file of the /proc directory $1 into the caller's variable stat_line. Fails for a
+# process that is gone and for a kernel thread (PF_KTHREAD, 0x00200000, in the flags, the seventh
+# field after the name).
+_memspread_read_stat()
+{
+    local -a fields
+    read -r stat_line 2>/dev/null <"$1/stat" || return 1
+    read -ra fields <<<"${stat_line##*") "}"
+    ! ((${fields[6]:-0} & 0x00200000))
 }
 
 # Adds to COMPREPLY the lines of standard input that start with the word $1 (as typed, quotes

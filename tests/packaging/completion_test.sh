@@ -70,6 +70,11 @@ expect_offered 'memspread -x memspread' "$quoted"
 expect_offered "memspread $pid" "$pid"
 expect_offered "memspread --pid ${pid:0:1}" "$pid"
 [[ -z $(complete_line 'memspread completion') ]] || fail "a name matched in its middle"
+# Kernel threads cannot be measured: kthreadd, where this system shows it, is not offered.
+if [[ $(cat /proc/2/comm 2>/dev/null) == kthreadd ]]; then
+    complete_line 'memspread 2' | grep -qx 2 && fail "the kernel thread 2 is offered"
+    complete_line 'memspread kthread' | grep -q . && fail "the kernel thread kthreadd is offered"
+fi
 [[ -z $(complete_line 'memspread --pid memspread') ]] || fail "--pid offered names"
 
 # Files for -j and for a target that looks like a path.
