@@ -64,6 +64,7 @@ void RKMemspread::analyzeData() {
     pidToMemspread_.clear();
     identityMaps_ = std::make_unique<RKIdentityMaps>(processes_.size());
     for (const auto& process : processes_) _addProcess(*process);
+    for (RKMemoryObject* object : identityMaps_->ownedBySeveral) object->setOwnerPid(-1);
     finalizeObjects();
     _buildProcessToMemspreadMap();
 }
@@ -90,8 +91,10 @@ void RKMemspread::_addProcess(const RKProcess& process) {
         } else {
             object->addRegion(region, process);
         }
-        // When several processes claim one object, the last in process order owns it.
-        if (breakDown && region->ownedExclusivelyByParentProcess) object->setOwnerPid(process.pid());
+        if (breakDown && region->ownedExclusivelyByParentProcess) {
+            if (object->ownerPid() != -1 && object->ownerPid() != process.pid()) maps.ownedBySeveral.insert(object.get());
+            object->setOwnerPid(process.pid());
+        }
         region->setMemoryObject(object);
     }
 }

@@ -133,6 +133,7 @@ struct RKOwnedVmObjectRecord {
     uint64_t reusable_size = 0;
     uint64_t compressed_size = 0;
     uint32_t flags = 0;  // bit 0 vo_no_memspread, bits 1-3 vo_ledger_tag, bits 4-5 purgable
+    std::string detail;  // what tells the object apart (a memfd's name, a path); may be empty
 };
 
 // mach_get_times.

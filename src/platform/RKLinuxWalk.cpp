@@ -146,6 +146,11 @@ std::optional<uint64_t> RKShmemDevice() {
     return device;
 }
 
+std::shared_ptr<const RKMountTable> RKMountTableForTask(RKLinuxTask& task, const std::string& procRoot,
+                                                        bool reread) {
+    return mountTableFor(task.directoryFd(), procRoot, namespaceInode(task.directoryFd(), "ns/mnt"), reread);
+}
+
 kern_return_t RKLoadWalkSnapshot(RKLinuxTask& task, const std::string& procRoot, uint64_t pageSize,
                                  std::unique_ptr<RKLinuxWalkSnapshot>& snapshot) {
     auto fresh = std::make_unique<RKLinuxWalkSnapshot>();
