@@ -124,7 +124,12 @@ uint64_t RKMemspread::_calculateMemspreadForProcess(const RKProcess& process) co
     const RKRegionList& regions = *process.memoryRegions();
     uint64_t memspread = 0;
     if (breakDownPhysMemspread()) {
-        for (const auto& region : regions) memspread += region->dirtySize + region->swappedSize;
+        for (const auto& region : regions) {
+            // Memory another process owns is that process's, as the views show it.
+            std::shared_ptr<RKMemoryObject> object = region->memoryObject();
+            if (object && object->ownerPid() != -1 && object->ownerPid() != process.pid()) continue;
+            memspread += region->dirtySize + region->swappedSize;
+        }
         return memspread;
     }
     // Every process that maps an object is charged its whole dirty and swapped bytes, once.
