@@ -6,6 +6,7 @@
 
 #include "analysis/RKCancelSource.h"
 #include "analysis/RKWorkerPool.h"
+#include "process/RKUserProcess.h"
 
 namespace {
 
@@ -32,6 +33,15 @@ RKProcessList RKMemspread::_processesBySortingPidDesc(const RKProcessList& proce
     return sorted;
 }
 
+// Memory that no process holds reaches the report through the lowest-pid process shown.
+void RKMemspread::_addUnheldMemoryWarnings(const RKProcessList& sortedByPidDesc) {
+    for (auto it = sortedByPidDesc.rbegin(); it != sortedByPidDesc.rend(); ++it) {
+        if ((*it)->hiddenFromDisplay()) continue;
+        for (const std::string& warning : RKUserProcess::unheldSharedMemoryWarnings()) (*it)->_addGlobalWarning(warning);
+        return;
+    }
+}
+
 bool RKMemspread::gatherData() {
     RKProcessList sorted = _processesBySortingPidDesc(processes_);
     gatherStartTime_ = RKTime::now();
@@ -48,6 +58,7 @@ bool RKMemspread::gatherData() {
         sorted[i]->gatherData();
     });
     if (cancelled.load()) sorted.back()->_addGlobalError(kEarlyExitError);
+    _addUnheldMemoryWarnings(sorted);
     gatherEndTime_ = RKTime::now();
     return cancelled.load();
 }

@@ -136,6 +136,17 @@ struct RKOwnedVmObjectRecord {
     std::string detail;  // what tells the object apart (a memfd's name, a path); may be empty
 };
 
+// One SysV shared memory segment of the system (a line of /proc/sysvipc/shm). Sizes are in
+// bytes; resident and swapped count the segment's own pages, whoever touched them.
+struct RKSysVSegment {
+    int64_t shmid = 0;
+    uint64_t size = 0;
+    pid_t creator = 0;      // cpid, in the reader's pid namespace
+    uint64_t attached = 0;  // nattch: the number of mappings
+    uint64_t resident = 0;
+    uint64_t swapped = 0;
+};
+
 // mach_get_times.
 struct RKClockReadings {
     uint64_t absolute = 0;    // ticks of the uptime clock

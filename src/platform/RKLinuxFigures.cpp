@@ -50,6 +50,10 @@ int RKLinuxPlatform::ledgerEntries(RKTask& task, std::vector<int64_t>& balances)
     return 0;
 }
 
+int RKLinuxPlatform::sysVSegments(std::vector<RKSysVSegment>& segments) {
+    return RKReadSysVSegments(procRoot(), segments);
+}
+
 int RKLinuxPlatform::ownedVmObjects(RKTask& task, std::vector<RKOwnedVmObjectRecord>& records) {
     auto* target = dynamic_cast<RKLinuxTask*>(&task);
     if (!target) return EINVAL;

@@ -255,6 +255,13 @@ void RKDescriptorScan::addSysVSegments() {
 
 }  // namespace
 
+int RKReadSysVSegments(const std::string& procRoot, std::vector<RKSysVSegment>& segments) {
+    std::string text;
+    if (int error = RKReadFileAt(AT_FDCWD, (procRoot + "/sysvipc/shm").c_str(), text)) return error;
+    segments = RKParseSysVShm(text);
+    return 0;
+}
+
 int RKReadOwnedObjects(RKLinuxTask& task, const std::string& procRoot, uint64_t pageSize,
                        std::vector<RKOwnedVmObjectRecord>& records) {
     records.clear();

@@ -16,6 +16,9 @@ inline constexpr uint8_t RKObjectKindDmaBuf = 5;
 // Ledger tag under which dma-bufs are listed (named "graphics").
 inline constexpr uint32_t RKLedgerTagGraphics = 4;
 
+// The system's SysV segments (/proc/sysvipc/shm under `procRoot`): 0, or the errno.
+int RKReadSysVSegments(const std::string& procRoot, std::vector<RKSysVSegment>& segments);
+
 // 0 and the records; EACCES or EPERM when the descriptors may not be read; ESRCH when the
 // process is gone. `procRoot` is where the system's sysvipc table is read.
 int RKReadOwnedObjects(RKLinuxTask& task, const std::string& procRoot, uint64_t pageSize,

@@ -11,16 +11,7 @@
 #include <string_view>
 #include <vector>
 
-// One line of /proc/sysvipc/shm. Sizes are in bytes; rss and swap count the segment's own
-// pages (resident, swapped), whoever touched them.
-struct RKSysVSegment {
-    int64_t shmid = 0;
-    uint64_t size = 0;
-    pid_t creator = 0;      // cpid, in the reader's pid namespace
-    uint64_t attached = 0;  // nattch: the number of mappings
-    uint64_t resident = 0;
-    uint64_t swapped = 0;
-};
+#include "platform/RKKernelTypes.h"
 
 // Columns are found by the header's names, so kernels that add or move columns still parse.
 // Lines that cannot be read are skipped; a table without rss and swap columns (kernels before

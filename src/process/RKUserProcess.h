@@ -114,6 +114,9 @@ public:
                                              int purgeState, RKRegionWalkState& state);
     // Appends a region without an address for every owned object the walk did not meet.
     virtual void _addUnconsumedOwnedObjectRegions(RKRegionWalkState& state);
+    // One warning for each SysV segment that nobody maps and whose creator is gone: memory that
+    // no process holds, so no process's report can show it.
+    static std::vector<std::string> unheldSharedMemoryWarnings();
 
     RKTask* task() const { return task_.get(); }
     uint64_t sharedRegionBase() const { return sharedRegionBase_; }

@@ -134,3 +134,19 @@ void RKUserProcess::_reconcileUnmappedOwnedRegion(RKRegionWalkState& state) {
     }
     unmapped.reset();
 }
+
+std::vector<std::string> RKUserProcess::unheldSharedMemoryWarnings() {
+    std::vector<std::string> warnings;
+    std::vector<RKSysVSegment> segments;
+    RKPlatform& platform = RKPlatform::current();
+    if (platform.sysVSegments(segments) != 0) return warnings;
+    for (const RKSysVSegment& segment : segments) {
+        uint32_t status = 0;
+        if (segment.attached != 0 || platform.shortBsdInfoStatus(segment.creator, status) != ESRCH) continue;
+        warnings.push_back("SysV shared memory segment " + std::to_string(segment.shmid) + " holds " +
+                           std::to_string(segment.resident + segment.swapped) +
+                           " bytes that no process maps: its creator [" + std::to_string(segment.creator) +
+                           "] is gone");
+    }
+    return warnings;
+}

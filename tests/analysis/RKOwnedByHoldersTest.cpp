@@ -34,3 +34,21 @@ TEST(RKOwnedByHoldersTest, OneOwnerIsChargedAloneAndSeveralShareTheObject) {
     EXPECT_EQ(object->totalDirtySize(), 8192u) << "counted once";
     EXPECT_EQ(object->viewForProcess(*b)->totalDirtySize(), 4096u) << "each holder sees its own charge";
 }
+
+// Segments nobody maps whose creator is gone are held by no process: one warning each, on the
+// lowest-pid process shown, so that the report prints them once.
+TEST(RKOwnedByHoldersTest, SegmentsOfGoneCreatorsWarnOnTheLowestShownProcess) {
+    ScopedSettings settings(true);
+    auto platform = std::make_shared<RKScriptedPlatform>();
+    platform->addProcess(20, "alive");
+    platform->segments = {{.shmid = 5, .size = 8192, .creator = 99, .attached = 0, .resident = 4096, .swapped = 4096},
+                          {.shmid = 6, .size = 8192, .creator = 99, .attached = 1, .resident = 8192},
+                          {.shmid = 7, .size = 8192, .creator = 20, .attached = 0, .resident = 8192}};
+    RKScopedPlatform scope(platform);
+    auto hidden = makeProcess(10, {}, true), shown = makeProcess(20, {}), other = makeProcess(30, {});
+    RKMemspread memspread({other, shown, hidden});
+    memspread.gatherData();
+    EXPECT_EQ(shown->globalWarnings(), std::vector<std::string>{
+        "SysV shared memory segment 5 holds 8192 bytes that no process maps: its creator [99] is gone"});
+    EXPECT_TRUE(hidden->globalWarnings().empty() && other->globalWarnings().empty());
+}

@@ -3,6 +3,8 @@
 // open, an 8 MiB SysV segment it detached, an 8 MiB memfd it maps privately. Compared with the
 // kernel's own per-process figures, which count none of the held memory.
 #include <gtest/gtest.h>
+#include <sys/shm.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -117,4 +119,38 @@ TEST_F(RKOwnedMemoryFixtureTest, MapperSharesTheHeldMemfdAndUnmappedFindsIt) {
     EXPECT_EQ(reportedMemspread(run.standardOutput, mapper), 0u) << "hidden";
     EXPECT_NEAR(static_cast<double>(reportedMemspread(run.standardOutput, holder)),
                 static_cast<double>(holderMemspread), 4.0 * P);
+}
+
+// A segment whose creator is gone and that nobody maps is held by no process: the report says so.
+TEST_F(RKOwnedMemoryFixtureTest, SegmentOfAGoneCreatorIsAWarningOfTheReport) {
+    int ids[2];
+    ASSERT_EQ(pipe(ids), 0);
+    pid_t creator = fork();
+    if (creator == 0) {
+        int shmid = shmget(IPC_PRIVATE, MiB, IPC_CREAT | 0600);
+        void* p = shmid < 0 ? reinterpret_cast<void*>(-1) : shmat(shmid, nullptr, 0);
+        if (p != reinterpret_cast<void*>(-1)) {
+            std::memset(p, 1, MiB);
+            shmdt(p);
+        }
+        _exit(write(ids[1], &shmid, sizeof shmid) == sizeof shmid ? 0 : 1);
+    }
+    int shmid = -1;
+    ASSERT_EQ(read(ids[0], &shmid, sizeof shmid), static_cast<ssize_t>(sizeof shmid));
+    close(ids[0]);
+    close(ids[1]);
+    waitpid(creator, nullptr, 0);
+    ASSERT_GE(shmid, 0);
+
+    RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", std::to_string(fixture.pid())});
+    shmctl(shmid, IPC_RMID, nullptr);
+    ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
+    const std::string warning = "SysV shared memory segment " + std::to_string(shmid) + " holds " +
+                                std::to_string(MiB) + " bytes that no process maps: its creator [" +
+                                std::to_string(creator) + "] is gone";
+    EXPECT_NE(run.standardOutput.find("Warnings were encountered:\n\t" + warning + "\n"), std::string::npos)
+        << run.standardOutput;
+    EXPECT_EQ(run.standardOutput.find("SysV shared memory segment " + std::to_string(fixture.area("sysv")->address)),
+              std::string::npos)
+        << "the fixture's own segment is held by its creator";
 }
