@@ -33,13 +33,18 @@ RKProcessList RKMemspread::_processesBySortingPidDesc(const RKProcessList& proce
     return sorted;
 }
 
-// Memory that no process holds reaches the report through the lowest-pid process shown.
+// Memory of the live system that no process holds reaches the report through the lowest-pid
+// process shown. Snapshots alone say nothing of the live system.
 void RKMemspread::_addUnheldMemoryWarnings(const RKProcessList& sortedByPidDesc) {
-    for (auto it = sortedByPidDesc.rbegin(); it != sortedByPidDesc.rend(); ++it) {
-        if ((*it)->hiddenFromDisplay()) continue;
-        for (const std::string& warning : RKUserProcess::unheldSharedMemoryWarnings()) (*it)->_addGlobalWarning(warning);
-        return;
+    std::shared_ptr<RKProcess> lowestShown;
+    bool anyLive = false;
+    for (const auto& process : sortedByPidDesc) {
+        if (process->hiddenFromDisplay()) continue;
+        lowestShown = process;
+        anyLive = anyLive || process->_isAlive();
     }
+    if (!anyLive) return;
+    for (const std::string& warning : RKUserProcess::unheldSharedMemoryWarnings()) lowestShown->_addGlobalWarning(warning);
 }
 
 bool RKMemspread::gatherData() {

@@ -12,6 +12,7 @@
 #include <cerrno>
 #include <charconv>
 #include <chrono>
+#include <cstdio>
 #include <cstring>
 #include <memory>
 #include <mutex>
@@ -106,6 +107,21 @@ std::string detailFromLink(std::string link) {
     return link;
 }
 
+// A descriptor of our own on the file that `st` describes, for cachestat. The process may have
+// closed the descriptor and opened a device or a FIFO under its number since it was stat'ed, so
+// the link is first opened without opening the file (O_PATH) and the file checked, and only
+// then opened for reading.
+RKUniqueFd openSameFile(int fdDir, const char* name, const struct stat& st) {
+    RKUniqueFd path(::openat(fdDir, name, O_PATH | O_CLOEXEC));
+    struct stat now {};
+    if (!path.valid() || ::fstat(path.get(), &now) != 0 || !S_ISREG(now.st_mode) || now.st_dev != st.st_dev ||
+        now.st_ino != st.st_ino)
+        return RKUniqueFd();
+    char self[64];
+    std::snprintf(self, sizeof self, "/proc/self/fd/%d", path.get());
+    return RKUniqueFd(::open(self, O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
+}
+
 enum class RKHeldKind { None, Shmem, Hugetlb };
 
 // One process's descriptors, read through its /proc directory.
@@ -196,10 +212,8 @@ void RKDescriptorScan::addShmem(int fdDir, const char* name, const struct stat& 
     record.resident_size = allocated;
     if (huge) {
         record.wired_size = allocated;  // huge pages are never swapped or reclaimed
-    } else if (!gNoCachestat.load(std::memory_order_relaxed)) {
-        // cachestat splits them; it needs a descriptor of our own. Only regular files of
-        // memory file systems get here, so opening one cannot block or touch a device.
-        RKUniqueFd fd(::openat(fdDir, name, O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
+    } else if (allocated != 0 && !gNoCachestat.load(std::memory_order_relaxed)) {
+        RKUniqueFd fd = openSameFile(fdDir, name, st);
         RKCachestatRange range{0, 0};
         RKCachestat stat{};
         if (fd.valid()) {
