@@ -70,18 +70,6 @@ std::shared_ptr<const std::vector<RKSysVSegment>> sysVSegments(const std::string
     return cache.segments;
 }
 
-// RKDeviceKey of the kernel's internal hugetlbfs mount (MFD_HUGETLB memfds), which no
-// mountinfo lists; nothing where huge pages are not configured.
-std::optional<uint64_t> internalHugetlbDevice() {
-    static const std::optional<uint64_t> device = []() -> std::optional<uint64_t> {
-        RKUniqueFd fd(::memfd_create("memspread-hugetlb-probe", MFD_CLOEXEC | MFD_HUGETLB));
-        struct stat st {};
-        if (!fd.valid() || ::fstat(fd.get(), &st) != 0) return std::nullopt;
-        return RKDeviceKey(major(st.st_dev), minor(st.st_dev));
-    }();
-    return device;
-}
-
 uint64_t namespaceInode(const std::string& path) {
     struct stat st {};
     return ::stat(path.c_str(), &st) == 0 ? st.st_ino : 0;
@@ -183,7 +171,7 @@ void RKDescriptorScan::addDescriptor(int fdDir, const char* name) {
 
 RKHeldKind RKDescriptorScan::kindOfDevice(uint64_t device) {
     if (device == RKShmemDevice()) return RKHeldKind::Shmem;
-    if (device == internalHugetlbDevice()) return RKHeldKind::Hugetlb;
+    if (device == RKInternalHugetlbDevice()) return RKHeldKind::Hugetlb;
     if (!mounts_) mounts_ = RKMountTableForTask(task_, procRoot_);
     auto it = mounts_->find(device);
     if (it == mounts_->end() && !mountsReread_) {

@@ -25,3 +25,6 @@ std::shared_ptr<const RKMountTable> RKMountTableForTask(RKLinuxTask& task, const
 
 // RKDeviceKey of the kernel's internal shmem mount, learnt once from a memfd of our own.
 std::optional<uint64_t> RKShmemDevice();
+// RKDeviceKey of the kernel's internal hugetlbfs mount (MFD_HUGETLB memfds), which no mountinfo
+// lists; nothing where huge pages are not configured.
+std::optional<uint64_t> RKInternalHugetlbDevice();
