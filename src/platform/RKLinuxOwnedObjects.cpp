@@ -61,9 +61,8 @@ std::shared_ptr<const std::vector<RKSysVSegment>> sysVSegments(const std::string
     std::lock_guard<std::mutex> lock(cache.mutex);
     auto now = std::chrono::steady_clock::now();
     if (cache.segments && cache.procRoot == procRoot && now - cache.readAt < kSysVTableLifetime) return cache.segments;
-    std::string text;
     std::vector<RKSysVSegment> segments;
-    if (RKReadFileAt(AT_FDCWD, (procRoot + "/sysvipc/shm").c_str(), text) == 0) segments = RKParseSysVShm(text);
+    RKReadSysVSegments(procRoot, segments);  // none when it cannot be read
     cache.segments = std::make_shared<const std::vector<RKSysVSegment>>(std::move(segments));
     cache.procRoot = procRoot;
     cache.readAt = now;
@@ -146,7 +145,6 @@ int RKDescriptorScan::run() {
         ::close(fdDir);
         return error;
     }
-    errno = 0;
     while (const dirent* entry = ::readdir(directory.get())) {
         if (entry->d_name[0] >= '0' && entry->d_name[0] <= '9') addDescriptor(fdDir, entry->d_name);
     }
