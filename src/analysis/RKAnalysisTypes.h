@@ -8,6 +8,7 @@
 #include <cstdint>
 #include <memory>
 #include <unordered_map>
+#include <unordered_set>
 #include <vector>
 
 class RKMemoryObject;
@@ -37,6 +38,9 @@ struct RKIdentityMaps {
     RKIdentityMap textMemoryObjects;                   // text segments, by object_id
     RKIdentityMap linkeditMemoryObjects;               // link-edit segments, by object_id
     RKMemoryObjectList uniqueMemoryObjects;            // objects of one region only
+    // Objects that more than one process owns (a memfd whose descriptor several hold): no one
+    // process owns them, so they are shared memory of their holders.
+    std::unordered_set<RKMemoryObject*> ownedBySeveral;
 };
 
 using RKPidToMemspreadMap = std::unordered_map<pid_t, uint64_t>;

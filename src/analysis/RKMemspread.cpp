@@ -6,6 +6,7 @@
 
 #include "analysis/RKCancelSource.h"
 #include "analysis/RKWorkerPool.h"
+#include "process/RKUserProcess.h"
 
 namespace {
 
@@ -32,6 +33,20 @@ RKProcessList RKMemspread::_processesBySortingPidDesc(const RKProcessList& proce
     return sorted;
 }
 
+// Memory of the live system that no process holds reaches the report through the lowest-pid
+// process shown. Snapshots alone say nothing of the live system.
+void RKMemspread::_addUnheldMemoryWarnings(const RKProcessList& sortedByPidDesc) {
+    std::shared_ptr<RKProcess> lowestShown;
+    bool anyLive = false;
+    for (const auto& process : sortedByPidDesc) {
+        if (process->hiddenFromDisplay()) continue;
+        lowestShown = process;
+        anyLive = anyLive || process->_isAlive();
+    }
+    if (!anyLive) return;
+    for (const std::string& warning : RKUserProcess::unheldSharedMemoryWarnings()) lowestShown->_addGlobalWarning(warning);
+}
+
 bool RKMemspread::gatherData() {
     RKProcessList sorted = _processesBySortingPidDesc(processes_);
     gatherStartTime_ = RKTime::now();
@@ -48,6 +63,7 @@ bool RKMemspread::gatherData() {
         sorted[i]->gatherData();
     });
     if (cancelled.load()) sorted.back()->_addGlobalError(kEarlyExitError);
+    _addUnheldMemoryWarnings(sorted);
     gatherEndTime_ = RKTime::now();
     return cancelled.load();
 }

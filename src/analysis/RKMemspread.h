@@ -45,6 +45,7 @@ public:
     bool gatherData();
     // The processes by descending pid (the gathering order).
     static RKProcessList _processesBySortingPidDesc(const RKProcessList& processes);
+    static void _addUnheldMemoryWarnings(const RKProcessList& sortedByPidDesc);
     void cancel() { earlyExit_.store(true); }
 
     void analyzeData();

@@ -64,6 +64,7 @@ void RKMemspread::analyzeData() {
     pidToMemspread_.clear();
     identityMaps_ = std::make_unique<RKIdentityMaps>(processes_.size());
     for (const auto& process : processes_) _addProcess(*process);
+    for (RKMemoryObject* object : identityMaps_->ownedBySeveral) object->setOwnerPid(-1);
     finalizeObjects();
     _buildProcessToMemspreadMap();
 }
@@ -90,8 +91,10 @@ void RKMemspread::_addProcess(const RKProcess& process) {
         } else {
             object->addRegion(region, process);
         }
-        // When several processes claim one object, the last in process order owns it.
-        if (breakDown && region->ownedExclusivelyByParentProcess) object->setOwnerPid(process.pid());
+        if (breakDown && region->ownedExclusivelyByParentProcess) {
+            if (object->ownerPid() != -1 && object->ownerPid() != process.pid()) maps.ownedBySeveral.insert(object.get());
+            object->setOwnerPid(process.pid());
+        }
         region->setMemoryObject(object);
     }
 }
@@ -121,7 +124,12 @@ uint64_t RKMemspread::_calculateMemspreadForProcess(const RKProcess& process) co
     const RKRegionList& regions = *process.memoryRegions();
     uint64_t memspread = 0;
     if (breakDownPhysMemspread()) {
-        for (const auto& region : regions) memspread += region->dirtySize + region->swappedSize;
+        for (const auto& region : regions) {
+            // Memory another process owns is that process's, as the views show it.
+            std::shared_ptr<RKMemoryObject> object = region->memoryObject();
+            if (object && object->ownerPid() != -1 && object->ownerPid() != process.pid()) continue;
+            memspread += region->dirtySize + region->swappedSize;
+        }
         return memspread;
     }
     // Every process that maps an object is charged its whole dirty and swapped bytes, once.

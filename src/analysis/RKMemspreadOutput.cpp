@@ -41,6 +41,7 @@ struct RKMemspread::ReportState {
     RKProcessList withWarnings;
     RKProcessList withErrors;
     std::vector<std::string> globalErrors;
+    std::vector<std::string> globalWarnings;
     std::shared_ptr<RKAuxDataMap> globalAuxData;  // of the processes without errors
 };
 
@@ -58,6 +59,8 @@ void RKMemspread::printOutputVerbose(bool verbose, bool summarize) {
     ReportState report;
     for (const auto& process : reported) _printReportedProcess(process, groups, summarize, report);
     for (const auto& formatter : outputFormatters_) {
+        if (!report.globalWarnings.empty() && formatter->implementsPrintGlobalWarnings())
+            formatter->printGlobalWarnings(report.globalWarnings);
         formatter->printProcessesWithWarnings(report.withWarnings, report.withErrors, report.globalErrors);
     }
 
@@ -92,6 +95,8 @@ void RKMemspread::_printReportedProcess(const std::shared_ptr<RKProcess>& report
 
     const auto& errors = process.globalErrors();
     report.globalErrors.insert(report.globalErrors.end(), errors.begin(), errors.end());
+    const auto& warnings = process.globalWarnings();
+    report.globalWarnings.insert(report.globalWarnings.end(), warnings.begin(), warnings.end());
 }
 
 void RKMemspread::_printProcessHeader(RKProcess& process, bool hasErrors) {

@@ -37,6 +37,10 @@ public:
                                        const RKProcess& process, bool hasProcessView,
                                        const RKMemoryTotal& total) = 0;
     virtual void printProcessAuxData(const std::shared_ptr<RKAuxDataMap>& auxData) = 0;
+    // Optional: warnings about the system rather than one process (memory no process holds),
+    // given just before printProcessesWithWarnings when there are any.
+    virtual bool implementsPrintGlobalWarnings() const { return false; }
+    virtual void printGlobalWarnings(const std::vector<std::string>&) {}
     virtual void printProcessesWithWarnings(const RKProcessList& processesWithWarnings,
                                             const RKProcessList& processesWithErrors,
                                             const std::vector<std::string>& globalErrors) = 0;

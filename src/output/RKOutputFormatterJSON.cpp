@@ -172,7 +172,8 @@ void RKOutputFormatterJSON::printProcessesWithWarnings(const RKProcessList& proc
         errors.insert(errors.end(), own.begin(), own.end());
     }
     _writeStrings("errors", errors);
-    std::vector<std::string> warnings;
+    std::vector<std::string> warnings = std::move(globalWarnings_);
+    globalWarnings_.clear();
     for (const auto& process : processesWithWarnings) {
         warnings.insert(warnings.end(), process->warnings().begin(), process->warnings().end());
     }

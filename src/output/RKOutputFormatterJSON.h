@@ -63,6 +63,9 @@ public:
     void close() override;
     // Records only that regions are wanted in the process objects.
     bool implementsPrintSpanlistLikeOutput() const override { return true; }
+    // Kept for the report's "warnings", ahead of the processes' own.
+    bool implementsPrintGlobalWarnings() const override { return true; }
+    void printGlobalWarnings(const std::vector<std::string>& warnings) override { globalWarnings_ = warnings; }
     void printSpanlistLikeOutputForProcess(const RKProcess&, const RKRegionList&) override { verbose_ = true; }
 
     bool isOpen() const { return json_ != nullptr; }
@@ -94,6 +97,7 @@ private:
 
     bool verbose_ = false;
     bool multipleOutputs_ = false;
+    std::vector<std::string> globalWarnings_;  // of the report being written
     std::vector<SharedRecord> shared_;
     GroupSet addedProcessGroups_;
     uint64_t pageSize_ = 0;

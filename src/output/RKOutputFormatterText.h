@@ -45,6 +45,10 @@ public:
     bool implementsConfigureForMultipleOutputs() const override { return true; }
     void configureForMultipleOutputs() override { multipleOutputs_ = true; }
     bool implementsPrintSpanlistLikeOutput() const override { return true; }
+    bool implementsPrintGlobalWarnings() const override { return true; }
+    void printGlobalWarnings(const std::vector<std::string>& warnings) override {
+        _printMessages("\nWarnings were encountered:\n", warnings);
+    }
     void printSpanlistLikeOutputForProcess(const RKProcess& process, const RKRegionList& regions) override;
 
     int64_t summaryFormat() const { return summaryFormat_; }

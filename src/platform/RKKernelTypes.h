@@ -133,6 +133,18 @@ struct RKOwnedVmObjectRecord {
     uint64_t reusable_size = 0;
     uint64_t compressed_size = 0;
     uint32_t flags = 0;  // bit 0 vo_no_memspread, bits 1-3 vo_ledger_tag, bits 4-5 purgable
+    std::string detail;  // what tells the object apart (a memfd's name, a path); may be empty
+};
+
+// One SysV shared memory segment of the system (a line of /proc/sysvipc/shm). Sizes are in
+// bytes; resident and swapped count the segment's own pages, whoever touched them.
+struct RKSysVSegment {
+    int64_t shmid = 0;
+    uint64_t size = 0;
+    pid_t creator = 0;      // cpid, in the reader's pid namespace
+    uint64_t attached = 0;  // nattch: the number of mappings
+    uint64_t resident = 0;
+    uint64_t swapped = 0;
 };
 
 // mach_get_times.

@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cerrno>
 
+#include "platform/RKLinuxOwnedObjects.h"
 #include "platform/RKLinuxPlatform.h"
 #include "platform/RKLinuxTask.h"
 #include "platform/RKProcFile.h"
@@ -49,5 +50,12 @@ int RKLinuxPlatform::ledgerEntries(RKTask& task, std::vector<int64_t>& balances)
     return 0;
 }
 
-// First version: no list of owned objects (the kernel interface is absent).
-int RKLinuxPlatform::ownedVmObjects(RKTask&, std::vector<RKOwnedVmObjectRecord>&) { return ENOENT; }
+int RKLinuxPlatform::sysVSegments(std::vector<RKSysVSegment>& segments) {
+    return RKReadSysVSegments(procRoot(), segments);
+}
+
+int RKLinuxPlatform::ownedVmObjects(RKTask& task, std::vector<RKOwnedVmObjectRecord>& records) {
+    auto* target = dynamic_cast<RKLinuxTask*>(&task);
+    if (!target) return EINVAL;
+    return RKReadOwnedObjects(*target, procRoot(), kernelPageSize(), records);
+}

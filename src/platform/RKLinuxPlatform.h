@@ -37,6 +37,7 @@ public:
     int ledgerTemplate(std::vector<std::string>& names) override;
     int ledgerEntries(RKTask& task, std::vector<int64_t>& balances) override;
     int ownedVmObjects(RKTask& task, std::vector<RKOwnedVmObjectRecord>& records) override;
+    int sysVSegments(std::vector<RKSysVSegment>& segments) override;
 
     // Settings and host (RKLinuxPlatform.cpp).
     int readSelfRegionMemspread(int32_t& value) override;

@@ -97,7 +97,8 @@ uint32_t dirtiedPages(const RKSmapsVma& vma, RKVmaKind kind, uint64_t pageSize) 
         case RKVmaKind::Hugetlb: return pages(vma.privateHugetlb + vma.sharedHugetlb, pageSize);
         case RKVmaKind::Anonymous: return pages(vma.rss - std::min(vma.rss, vma.lazyFree), pageSize);
         case RKVmaKind::Shmem:
-            if (!isShared(vma)) return pages(vma.anonymous, pageSize);
+            // Privately mapped too, every resident page is memory: the object's own pages (shmem,
+            // never page cache) and the copies written through the mapping.
             return pages(vma.rss - std::min(vma.rss, vma.lazyFree), pageSize);
         case RKVmaKind::File:
             if (!isShared(vma)) return pages(vma.anonymous, pageSize);
@@ -129,8 +130,10 @@ uint8_t objectKindTag(const RKSmapsVma& vma, RKVmaKind kind) {
 bool mapsSharedObject(const RKSmapsVma& vma, RKVmaKind kind) {
     switch (kind) {
         case RKVmaKind::File:
-        case RKVmaKind::Shmem:
             return isShared(vma) || (!(vma.perms & RKSmapsWrite) && vma.anonymous == 0);
+        // Until a page is copied, a private mapping of shmem shows the object's pages only:
+        // writable or not, it reaches the object (its regions then meet the object's holders).
+        case RKVmaKind::Shmem: return isShared(vma) || vma.anonymous == 0;
         case RKVmaKind::Hugetlb: return isShared(vma);
         default: return false;
     }

@@ -134,16 +134,29 @@ void classifyAll(RKLinuxTask& task, const std::vector<RKSmapsVma>& vmas, const R
     }
 }
 
+// The device of a memfd of our own made with `flags`.
+std::optional<uint64_t> memfdDevice(unsigned flags) {
+    RKUniqueFd fd(::memfd_create("memspread-device-probe", MFD_CLOEXEC | flags));
+    struct stat st {};
+    if (!fd.valid() || ::fstat(fd.get(), &st) != 0) return std::nullopt;
+    return RKDeviceKey(major(st.st_dev), minor(st.st_dev));
+}
+
 }  // namespace
 
 std::optional<uint64_t> RKShmemDevice() {
-    static const std::optional<uint64_t> device = []() -> std::optional<uint64_t> {
-        RKUniqueFd fd(::memfd_create("memspread-shmem-probe", MFD_CLOEXEC));
-        struct stat st {};
-        if (!fd.valid() || ::fstat(fd.get(), &st) != 0) return std::nullopt;
-        return RKDeviceKey(major(st.st_dev), minor(st.st_dev));
-    }();
+    static const std::optional<uint64_t> device = memfdDevice(0);
     return device;
+}
+
+std::optional<uint64_t> RKInternalHugetlbDevice() {
+    static const std::optional<uint64_t> device = memfdDevice(MFD_HUGETLB);
+    return device;
+}
+
+std::shared_ptr<const RKMountTable> RKMountTableForTask(RKLinuxTask& task, const std::string& procRoot,
+                                                        bool reread) {
+    return mountTableFor(task.directoryFd(), procRoot, namespaceInode(task.directoryFd(), "ns/mnt"), reread);
 }
 
 kern_return_t RKLoadWalkSnapshot(RKLinuxTask& task, const std::string& procRoot, uint64_t pageSize,

@@ -18,5 +18,13 @@ kern_return_t RKLoadWalkSnapshot(RKLinuxTask& task, const std::string& procRoot,
 // Gives the snapshot's text buffer back for reuse by the next read on this thread.
 void RKRecycleWalkSnapshot(std::unique_ptr<RKLinuxWalkSnapshot> snapshot);
 
+// The mount table of `task`'s mount namespace, shared with the walks of that namespace;
+// `reread` reads the target's file again (a device missing from the table may be a new mount).
+std::shared_ptr<const RKMountTable> RKMountTableForTask(RKLinuxTask& task, const std::string& procRoot,
+                                                        bool reread = false);
+
 // RKDeviceKey of the kernel's internal shmem mount, learnt once from a memfd of our own.
 std::optional<uint64_t> RKShmemDevice();
+// RKDeviceKey of the kernel's internal hugetlbfs mount (MFD_HUGETLB memfds), which no mountinfo
+// lists; nothing where huge pages are not configured.
+std::optional<uint64_t> RKInternalHugetlbDevice();

@@ -80,6 +80,9 @@ public:
     virtual int ledgerEntries(RKTask& task, std::vector<int64_t>& balances) = 0;
     // sysctl vm.get_owned_vmobjects: 0 and the records, or the errno (ENOENT: not supported).
     virtual int ownedVmObjects(RKTask& task, std::vector<RKOwnedVmObjectRecord>& records) = 0;
+    // The system's SysV shared memory segments (those memspread's IPC namespace shows): 0, or
+    // the errno.
+    virtual int sysVSegments(std::vector<RKSysVSegment>& segments) = 0;
 
     // ---- Settings and host ----
     // sysctl vm.self_region_memspread: 0 or the errno.

@@ -186,6 +186,12 @@ int RKScriptedPlatform::ownedVmObjects(RKTask& task, std::vector<RKOwnedVmObject
     return 0;
 }
 
+int RKScriptedPlatform::sysVSegments(std::vector<RKSysVSegment>& answer) {
+    record("sysVSegments");
+    answer = segments;
+    return 0;
+}
+
 int RKScriptedPlatform::readSelfRegionMemspread(int32_t& value) {
     record("readSelfRegionMemspread");
     if (selfRegionReadErrno != 0) return selfRegionReadErrno;

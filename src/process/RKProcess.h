@@ -37,6 +37,9 @@ public:
     virtual bool initWithBsdInfo(const RKBsdInfo& info);
     virtual uint64_t _gatherPageSize();
     void _addGlobalError(const std::string& error);
+    // A warning about the system rather than this process (memory no process holds); the
+    // report prints it once.
+    void _addGlobalWarning(const std::string& warning) { globalWarnings_.push_back(warning); }
 
     size_t hash() const { return static_cast<size_t>(pid_); }
     bool isEqual(const RKProcess& other) const { return pid_ == other.pid_; }
@@ -45,6 +48,7 @@ public:
     virtual void gatherData() {}
 
     const std::vector<std::string>& globalErrors() const { return globalErrors_; }
+    const std::vector<std::string>& globalWarnings() const { return globalWarnings_; }
     std::vector<std::string> errors() const { return errors_; }  // a snapshot copy
     const std::vector<std::string>& warnings() const { return warnings_; }
     int64_t asNumber() const { return pid_; }
@@ -98,6 +102,7 @@ private:
     bool isTranslated_ = false;
     int32_t idleExitStatus_ = 0;
     std::vector<std::string> globalErrors_;
+    std::vector<std::string> globalWarnings_;
     bool hiddenFromDisplay_ = false;
     std::string name_;
     std::optional<RKRegionList> memoryRegions_;

@@ -9,6 +9,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <unordered_set>
 #include <vector>
 
 #include "platform/RKPlatform.h"
@@ -35,6 +36,8 @@ struct RKRegionWalkState {
     // it has been reduced by the owned memory found mapped.
     std::shared_ptr<RKMemoryRegion> unmappedOwnedRegion;
     uint64_t mappedOwnedTotal = 0;  // bytes of owned memory charged to mapped regions
+    // Owned objects already charged whole to a mapping: further mappings add nothing.
+    std::unordered_set<uint64_t> chargedOwnedObjects;
     bool hidden = false;
     bool breakDown = false;
     bool sharingAnalysisDisabled = false;
@@ -98,17 +101,22 @@ public:
     virtual void _gatherImageData() {}
     // Names a region after the image segment it lies in. Not yet: false.
     virtual bool _nameRegionFromImages(RKMemoryRegion& region, RKRegionWalkState& state);
-    // The VM objects the task owns. Not yet: no list.
-    virtual std::optional<RKOwnedVmObjectMap> _gatherOwnedVmObjects() { return std::nullopt; }
+    // The VM objects the task owns (RKUserProcessOwned.cpp); none with the breakdown off, when
+    // the platform has no list, or when it could not be read.
+    virtual std::optional<RKOwnedVmObjectMap> _gatherOwnedVmObjects();
     // Cuts an entry of the shared region at image boundaries into `state.regions`; false when a
     // page query failed. Not yet: the entry is skipped (no shared region on this platform).
     virtual bool _addRegionsToArray(RKRegionWalkState& state, uint64_t start, uint64_t size,
                                     const RKRegionSubmapInfo& info);
-    // Charges a tag-named region from the owned-object list. Not yet: nothing changes.
+    // Charges a tag-named region from the owned-object list, or without a list a purgeable one
+    // from its own counters.
     virtual void _chargeOwnedObjectForRegion(RKMemoryRegion& region, const RKRegionSubmapInfo& info,
                                              int purgeState, RKRegionWalkState& state);
-    // Appends a region for every owned object the walk did not meet. Not yet: none.
+    // Appends a region without an address for every owned object the walk did not meet.
     virtual void _addUnconsumedOwnedObjectRegions(RKRegionWalkState& state);
+    // One warning for each SysV segment that nobody maps and whose creator is gone: memory that
+    // no process holds, so no process's report can show it.
+    static std::vector<std::string> unheldSharedMemoryWarnings();
 
     RKTask* task() const { return task_.get(); }
     uint64_t sharedRegionBase() const { return sharedRegionBase_; }

@@ -256,33 +256,6 @@ void RKUserProcess::_nameRegion(RKMemoryRegion& region, const RKRegionSubmapInfo
     }
 }
 
-void RKUserProcess::_reconcileUnmappedOwnedRegion(RKRegionWalkState& state) {
-    auto& unmapped = state.unmappedOwnedRegion;
-    if (!unmapped) return;
-    uint64_t excess = state.mappedOwnedTotal;
-    if (unmapped->dirtySize < excess) {
-        excess -= unmapped->dirtySize;
-        unmapped->dirtySize = 0;
-        if (unmapped->swappedSize >= excess) {
-            unmapped->swappedSize -= excess;
-        } else {
-            excess -= unmapped->swappedSize;
-            warnings_.push_back(displayString() +
-                                ": Memspread changed while analyzing – unmapped owned physical memspread may be "
-                                "over-counted by " +
-                                std::to_string(excess) + " bytes");
-            unmapped->swappedSize = 0;
-        }
-    } else {
-        unmapped->dirtySize -= excess;
-    }
-    if (unmapped->dirtySize + unmapped->swappedSize != 0) {
-        unmapped->start = RKRegionNoAddress;
-        state.regions.push_back(unmapped);
-    }
-    unmapped.reset();
-}
-
 void RKUserProcess::_addPageTableRegion(RKRegionWalkState& state) const {
     if (!state.breakDown || ledgers_ == 0) return;
     auto region = std::make_shared<RKMemoryRegion>();
@@ -335,6 +308,3 @@ bool RKUserProcess::_addRegionsToArray(RKRegionWalkState&, uint64_t, uint64_t, c
     return true;
 }
 
-void RKUserProcess::_chargeOwnedObjectForRegion(RKMemoryRegion&, const RKRegionSubmapInfo&, int, RKRegionWalkState&) {}
-
-void RKUserProcess::_addUnconsumedOwnedObjectRegions(RKRegionWalkState&) {}

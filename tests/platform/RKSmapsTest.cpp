@@ -71,7 +71,8 @@ TEST_F(RKSmapsTest, EachVmaBecomesTheRecordOfItsKind) {
         // Read faults that got private pages rather than the zero page: only swap frees them.
         {0x7f8735c27000, K::Anonymous, RKTagAnonymous, SM_PRIVATE, 32, 0, ""},
         {0x7f0000218000, K::Shmem, RKTagSharedAnonymous, SM_SHARED, 4, 0, "ring"},
-        {0x7f0000241000, K::Shmem, RKTagPosixShm, SM_COW, 0, 0, "/dev/shm/shared file"},
+        // Privately mapped shmem: the object's pages are memory, never page cache.
+        {0x7f0000241000, K::Shmem, RKTagPosixShm, SM_COW, 4, 0, "/dev/shm/shared file"},
         {0x7f000021d000, K::File, RKTagAnonymous, SM_COW, 0, 0, "/data/my file\\012name (deleted)"},  // 08:01
         {0x7f0000249000, K::File, RKTagAnonymous, SM_COW, 0, 0, "/srv/subvolume/lib.so"},  // major 0, mounted
         {0x7f0000231000, K::Device, RKTagDevice, SM_EMPTY, 0, 0, "/dev/dri/card0"},
@@ -135,4 +136,21 @@ TEST_F(RKSmapsTest, ParsingSkipsWhatItCannotReadWithoutLosingItsNeighbours) {
     ASSERT_FALSE(cut.empty());
     EXPECT_EQ(cut.back().path, "[anon:my buffer]");
     EXPECT_EQ(cut.back().vmFlags, 0u);
+}
+
+TEST_F(RKSmapsTest, PrivatelyMappedShmemIsMemoryAndReachesItsObjectUntilCopied) {
+    // A memfd mapped privately and writable: 8 pages resident, none copied yet.
+    RKSmapsVma vma = at(0x7f0000245000);
+    vma.perms = RKSmapsRead | RKSmapsWrite;
+    vma.rss = 32;
+    RKRegionSubmapInfo object = RKRegionInfoForVma(vma, RKVmaKind::Shmem, context_);
+    EXPECT_EQ(object.object_id_full, info(0x7f0000245000).object_id_full) << "the object's pages, shared";
+    EXPECT_EQ(object.pages_dirtied, 8u) << "shmem pages are memory, not clean page cache";
+
+    // Once written through, its copies make it the process's own: all 8 pages stay dirty.
+    vma.anonymous = 8;
+    RKRegionSubmapInfo copied = RKRegionInfoForVma(vma, RKVmaKind::Shmem, context_);
+    EXPECT_NE(copied.object_id_full, object.object_id_full);
+    EXPECT_EQ(copied.pages_dirtied, 8u);
+    EXPECT_EQ(copied.share_mode, SM_COW);
 }

@@ -1,0 +1,49 @@
+// The texts that describe memory held without a mapping: the SysV segment table (captured while
+// the owned-memory fixture held a detached segment) and a dma-buf's fdinfo (in the kernel's
+// format: the generic lines, then the buffer's).
+#include <gtest/gtest.h>
+
+#include <fstream>
+#include <sstream>
+
+#include "platform/RKOwnedObjectParsers.h"
+
+namespace {
+
+std::string testData(const char* name) {
+    std::stringstream text;
+    text << std::ifstream(std::string(MEMSPREAD_TEST_DATA "/") + name).rdbuf();
+    return text.str();
+}
+
+}  // namespace
+
+TEST(RKOwnedObjectParsersTest, SysVTableGivesEachSegmentsCreatorAttachCountAndPages) {
+    std::vector<RKSysVSegment> segments = RKParseSysVShm(testData("sysvipc-shm.txt"));
+    ASSERT_EQ(segments.size(), 1u);
+    EXPECT_EQ(segments[0].shmid, 62);
+    EXPECT_EQ(segments[0].size, 8388608u);
+    EXPECT_EQ(segments[0].creator, 7938);
+    EXPECT_EQ(segments[0].attached, 0u);
+    EXPECT_EQ(segments[0].resident, 8388608u);
+    EXPECT_EQ(segments[0].swapped, 0u);
+
+    // Columns are found by name; a line that cannot be read is skipped.
+    segments = RKParseSysVShm("shmid nattch cpid size swap rss\n7 2 100 4096 0 4096\nbroken line\n");
+    ASSERT_EQ(segments.size(), 1u);
+    EXPECT_EQ(segments[0].attached, 2u);
+    EXPECT_EQ(segments[0].creator, 100);
+    // A kernel that does not say how much is resident gives nothing rather than a guess.
+    EXPECT_TRUE(RKParseSysVShm("key shmid perms size cpid lpid nattch\n0 7 600 4096 100 100 0\n").empty());
+}
+
+TEST(RKOwnedObjectParsersTest, DmaBufFdinfoGivesSizeInodeAndExporter) {
+    auto info = RKParseDmaBufFdinfo(testData("fdinfo-dmabuf.txt"));
+    ASSERT_TRUE(info);
+    EXPECT_EQ(info->size, 8294400u);
+    EXPECT_EQ(info->inode, 2051u);
+    EXPECT_EQ(info->exporter, "system");
+    // Not a dma-buf (an ordinary file's fdinfo), or no inode line: nothing.
+    EXPECT_FALSE(RKParseDmaBufFdinfo("pos:\t0\nflags:\t0100002\nmnt_id:\t25\nino:\t12\n"));
+    EXPECT_FALSE(RKParseDmaBufFdinfo("size:\t4096\nexp_name:\tsystem\n"));
+}
