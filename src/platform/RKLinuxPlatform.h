@@ -38,6 +38,9 @@ public:
     int ledgerEntries(RKTask& task, std::vector<int64_t>& balances) override;
     int ownedVmObjects(RKTask& task, std::vector<RKOwnedVmObjectRecord>& records) override;
 
+    // The kernel (RKLinuxKernelMemoryReader.cpp).
+    kern_return_t memoryInfo(RKKernelMemoryInfo& info) override;
+
     // Settings and host (RKLinuxPlatform.cpp).
     int readSelfRegionMemspread(int32_t& value) override;
     int writeSelfRegionMemspread(int32_t value) override;

@@ -17,6 +17,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/RKKernelMemoryInfo.h"
 #include "platform/RKKernelTypes.h"
 
 // An open handle on one process. On Linux it is a directory descriptor of /proc/PID, so a
@@ -80,6 +81,11 @@ public:
     virtual int ledgerEntries(RKTask& task, std::vector<int64_t>& balances) = 0;
     // sysctl vm.get_owned_vmobjects: 0 and the records, or the errno (ENOENT: not supported).
     virtual int ownedVmObjects(RKTask& task, std::vector<RKOwnedVmObjectRecord>& records) = 0;
+
+    // ---- The kernel ----
+    // mach_memory_info: KERN_SUCCESS and the kernel's zones, wired sites, counters and loaded
+    // modules, or the failure code.
+    virtual kern_return_t memoryInfo(RKKernelMemoryInfo& info) = 0;
 
     // ---- Settings and host ----
     // sysctl vm.self_region_memspread: 0 or the errno.

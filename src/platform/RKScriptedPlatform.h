@@ -70,6 +70,9 @@ public:
     int32_t selfRegionValue = 0;
     int selfRegionReadErrno = 0;
     int selfRegionWriteErrno = 0;
+    // What memoryInfo answers: these records, or this failure.
+    RKKernelMemoryInfo kernelMemory;
+    kern_return_t kernelMemoryResult = KERN_SUCCESS;
 
     // Adds a process with a BSD record made of the given fields and returns it for further
     // scripting. The reference stays valid until the next addProcess.
@@ -100,6 +103,7 @@ public:
     int ledgerTemplate(std::vector<std::string>& names) override;
     int ledgerEntries(RKTask& task, std::vector<int64_t>& balances) override;
     int ownedVmObjects(RKTask& task, std::vector<RKOwnedVmObjectRecord>& records) override;
+    kern_return_t memoryInfo(RKKernelMemoryInfo& info) override;
     int readSelfRegionMemspread(int32_t& value) override;
     int writeSelfRegionMemspread(int32_t value) override;
     bool getTimes(RKClockReadings& readings) override;
