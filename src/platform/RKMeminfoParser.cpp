@@ -2,12 +2,12 @@
 
 #include <charconv>
 
+#include "platform/RKTextFields.h"
+
 std::optional<std::map<std::string, uint64_t, std::less<>>> RKParseMeminfo(std::string_view text) {
     std::map<std::string, uint64_t, std::less<>> figures;
     while (!text.empty()) {
-        size_t newline = text.find('\n');
-        std::string_view line = text.substr(0, newline);
-        text.remove_prefix(newline == std::string_view::npos ? text.size() : newline + 1);
+        std::string_view line = RKNextLine(text);
         size_t colon = line.find(':');
         if (colon == 0 || colon == std::string_view::npos) continue;
         std::string_view rest = line.substr(colon + 1);
