@@ -32,7 +32,7 @@ RKSystemMemory RKAccountForSystemMemory(const RKProcessList& processes, bool bre
     int64_t userMemory = 0, pageTables = 0;
     std::unordered_set<const RKMemoryObject*> seen;
     for (const auto& process : processes) {
-        if (process.get() == kernel || dynamic_cast<const RKKernelProcess*>(process.get())) continue;
+        if (dynamic_cast<const RKKernelProcess*>(process.get())) continue;
         if (!process->memoryRegions() || !process->errors().empty()) {
             ++result.unreadableProcesses;
             continue;
