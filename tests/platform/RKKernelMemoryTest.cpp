@@ -111,7 +111,8 @@ TEST_F(RKKernelMemoryTest, ParsersReadEveryLineOfTheCapturesAndRefuseWhatIsNotTh
     EXPECT_EQ(RKParseVmallocinfo("not an area\n0x1-0x2 big\n", areas), 2u);
 
     std::vector<RKKernelModule> list;
-    EXPECT_EQ(RKParseModules(modules + "broken\nalso 12x 0 - Live\n", list), 2u);
+    const std::string withBrokenLines = modules + "broken\nalso 12x 0 - Live\n";
+    EXPECT_EQ(RKParseModules(withBrokenLines, list), 2u);
     ASSERT_EQ(list.size(), 5u);
     EXPECT_EQ(list[2].name, "net_failover");
     EXPECT_EQ(list[2].size, 24576u);
