@@ -1,6 +1,6 @@
 #include "process/RKKernelProcess.h"
 
-#include <cinttypes>
+#include <algorithm>
 #include <cstdio>
 
 #include "model/RKAuxData.h"
