@@ -80,6 +80,10 @@ public:
     const RKProcessList& processes() const { return processes_; }
     uint32_t qualityOfService() const { return qualityOfService_; }
     void setQualityOfService(uint32_t qos) { qualityOfService_ = qos; }
+    // Whether the processes are every process of the system (-a): the report then accounts for
+    // the machine's memory in the global auxiliary data ("system").
+    bool measuresWholeSystem() const { return measuresWholeSystem_; }
+    void setMeasuresWholeSystem(bool value) { measuresWholeSystem_ = value; }
     const std::optional<RKTime>& gatherStartTime() const { return gatherStartTime_; }
     const std::optional<RKTime>& gatherEndTime() const { return gatherEndTime_; }
 
@@ -88,6 +92,7 @@ private:
     RKOutputFormatterList outputFormatters_;
     std::atomic<bool> earlyExit_{false};
     uint32_t qualityOfService_ = QOS_CLASS_UTILITY;
+    bool measuresWholeSystem_ = false;
     std::optional<RKTime> gatherStartTime_;
     std::optional<RKTime> gatherEndTime_;
     // Analysis state: the identity maps live from analyzeData until the groups are built.
@@ -98,6 +103,7 @@ private:
     void _printReportedProcess(const std::shared_ptr<RKProcess>& process, const RKProcessToGroupsMap& groups,
                                bool summarize, ReportState& report);
     void _printProcessHeader(RKProcess& process, bool hasErrors);
+    void _addSystemMemory(ReportState& report) const;
     void _printProcessGroups(RKProcess& process, const RKProcessGroupList* groups, bool summarize);
     void _printGroup(RKProcessGroup& group, RKProcess& process, bool summarize);
 };

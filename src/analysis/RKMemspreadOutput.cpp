@@ -1,6 +1,7 @@
 // Driving the formatters through one report. Every step calls the formatters in the order they
 // were added, the formatter loop being the innermost loop.
 #include "analysis/RKMemspread.h"
+#include "analysis/RKSystemMemory.h"
 #include "model/RKAuxData.h"
 #include "model/RKMemoryCategory.h"
 #include "model/RKMemoryObject.h"
@@ -58,6 +59,7 @@ void RKMemspread::printOutputVerbose(bool verbose, bool summarize) {
 
     ReportState report;
     for (const auto& process : reported) _printReportedProcess(process, groups, summarize, report);
+    if (measuresWholeSystem_) _addSystemMemory(report);
     for (const auto& formatter : outputFormatters_) {
         if (!report.globalWarnings.empty() && formatter->implementsPrintGlobalWarnings())
             formatter->printGlobalWarnings(report.globalWarnings);
@@ -72,6 +74,17 @@ void RKMemspread::printOutputVerbose(bool verbose, bool summarize) {
         formatter->printSummaryCategories(summary, summaryTotal, hadErrors);
         formatter->printGlobalAuxData(report.globalAuxData);
         formatter->endAtTime(timeOrZero(gatherEndTime_));
+    }
+}
+
+void RKMemspread::_addSystemMemory(ReportState& report) const {
+    RKSystemMemory system = RKAccountForSystemMemory(processes_, breakDownPhysMemspread());
+    if (!system.map) return;
+    if (!report.globalAuxData) report.globalAuxData = std::make_shared<RKAuxDataMap>();
+    report.globalAuxData->setObject("system", system.map);
+    if (system.unreadableProcesses != 0) {
+        report.globalErrors.push_back(std::to_string(system.unreadableProcesses) +
+                                      " processes could not be read: their memory is in the system's \"unattributed\"");
     }
 }
 

@@ -16,6 +16,7 @@ void RKSingleRun(const RKMemspreadArgs& args, const RKTargetMap& targets,
     processes.reserve(targets.size());
     for (const auto& entry : targets) processes.push_back(entry.second);
     RKMemspread memspread(std::move(processes));
+    memspread.setMeasuresWholeSystem(args.targetAll());
 
     // On a terminal Ctrl-C simply ends the program; with redirected output it cuts gathering
     // short and the report of what was gathered is still written.

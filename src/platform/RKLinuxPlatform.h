@@ -39,6 +39,9 @@ public:
     int ownedVmObjects(RKTask& task, std::vector<RKOwnedVmObjectRecord>& records) override;
     int sysVSegments(std::vector<RKSysVSegment>& segments) override;
 
+    // The kernel (RKLinuxKernelMemoryReader.cpp).
+    kern_return_t memoryInfo(RKKernelMemoryInfo& info) override;
+
     // Settings and host (RKLinuxPlatform.cpp).
     int readSelfRegionMemspread(int32_t& value) override;
     int writeSelfRegionMemspread(int32_t value) override;

@@ -17,6 +17,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/RKKernelMemoryInfo.h"
 #include "platform/RKKernelTypes.h"
 
 // An open handle on one process. On Linux it is a directory descriptor of /proc/PID, so a
@@ -83,6 +84,11 @@ public:
     // The system's SysV shared memory segments (those memspread's IPC namespace shows): 0, or
     // the errno.
     virtual int sysVSegments(std::vector<RKSysVSegment>& segments) = 0;
+
+    // ---- The kernel ----
+    // mach_memory_info: KERN_SUCCESS and the kernel's zones, wired sites, counters and loaded
+    // modules, or the failure code.
+    virtual kern_return_t memoryInfo(RKKernelMemoryInfo& info) = 0;
 
     // ---- Settings and host ----
     // sysctl vm.self_region_memspread: 0 or the errno.

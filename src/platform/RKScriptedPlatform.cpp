@@ -192,6 +192,13 @@ int RKScriptedPlatform::sysVSegments(std::vector<RKSysVSegment>& answer) {
     return 0;
 }
 
+kern_return_t RKScriptedPlatform::memoryInfo(RKKernelMemoryInfo& info) {
+    record("memoryInfo");
+    if (kernelMemoryResult != KERN_SUCCESS) return kernelMemoryResult;
+    info = kernelMemory;
+    return KERN_SUCCESS;
+}
+
 int RKScriptedPlatform::readSelfRegionMemspread(int32_t& value) {
     record("readSelfRegionMemspread");
     if (selfRegionReadErrno != 0) return selfRegionReadErrno;

@@ -71,6 +71,9 @@ public:
     int selfRegionReadErrno = 0;
     int selfRegionWriteErrno = 0;
     std::vector<RKSysVSegment> segments;  // the system's SysV segments
+    // What memoryInfo answers: these records, or this failure.
+    RKKernelMemoryInfo kernelMemory;
+    kern_return_t kernelMemoryResult = KERN_SUCCESS;
 
     // Adds a process with a BSD record made of the given fields and returns it for further
     // scripting. The reference stays valid until the next addProcess.
@@ -102,6 +105,7 @@ public:
     int ledgerEntries(RKTask& task, std::vector<int64_t>& balances) override;
     int ownedVmObjects(RKTask& task, std::vector<RKOwnedVmObjectRecord>& records) override;
     int sysVSegments(std::vector<RKSysVSegment>& segments) override;
+    kern_return_t memoryInfo(RKKernelMemoryInfo& info) override;
     int readSelfRegionMemspread(int32_t& value) override;
     int writeSelfRegionMemspread(int32_t value) override;
     bool getTimes(RKClockReadings& readings) override;

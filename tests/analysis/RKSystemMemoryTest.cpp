@@ -1,0 +1,139 @@
+// The system map on scripted answers: which figure goes to which term, memory shared between
+// processes counted once, the processes' page tables taken out of the kernel's, and processes
+// that could not be read left to "unattributed".
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <cstring>
+
+#include "analysis/RKSystemMemory.h"
+#include "platform/RKLinuxKernelKinds.h"
+#include "process/RKKernelProcess.h"
+#include "process/RKUserProcess.h"
+#include "analysis/RKAnalysisTestSupport.h"
+#include "support/RKRecordingFormatter.h"
+
+namespace {
+
+constexpr uint64_t P = 4096;
+
+RKMemoryInfoRecord counterRecord(std::string_view name, uint64_t value) {
+    RKMemoryInfoRecord record;
+    record.flags = VM_KERN_SITE_COUNTER;
+    record.site = static_cast<uint64_t>(
+        std::find(RKLinuxKernelCounters.begin(), RKLinuxKernelCounters.end(), name) - RKLinuxKernelCounters.begin());
+    record.mapped = value;
+    return record;
+}
+
+RKMemoryInfoRecord tagRecord(uint64_t tag, uint64_t size) {
+    RKMemoryInfoRecord record;
+    record.flags = VM_KERN_SITE_TAG | VM_KERN_SITE_WIRED;
+    record.site = tag;
+    record.size = size;
+    return record;
+}
+
+int64_t leaf(const RKAuxDataMap& map, const std::string& key) {
+    auto node = std::dynamic_pointer_cast<const RKAuxData>(map.objectForKey(key));
+    EXPECT_TRUE(node) << key;
+    return node ? node->value() : 0;
+}
+
+class RKSystemMemoryTest : public ::testing::Test {
+protected:
+    RKSystemMemoryTest() {
+        platform->addProcess(0, "kernel", 0, PROC_FLAG_SYSTEM);
+        RKScriptedProcess& tool = platform->addProcess(7, "tool");
+        RKScriptedRegion anonymous;
+        anonymous.start = 0x10000;
+        anonymous.size = 2 * P;
+        anonymous.info.pages_resident = 2;
+        anonymous.info.pages_dirtied = 2;
+        anonymous.info.share_mode = SM_PRIVATE;
+        anonymous.info.object_id_full = 0x4000000000010000ull;
+        tool.regions = {anonymous};
+        tool.ledgerBalances = {static_cast<int64_t>(P)};
+        platform->selfRegionValue = 1;  // the breakdown: processes are charged their page tables
+
+        RKKernelMemoryInfo& kernel = platform->kernelMemory;
+        RKZoneName name{};
+        std::strcpy(name.mzn_name, "dentry");
+        kernel.zoneNames = {name};
+        kernel.zones = {RKZoneInfo{.mzi_cur_size = 10000, .mzi_collectable = 1}};
+        kernel.sites = {tagRecord(RKKernelTagPageTables, 2 * P), tagRecord(RKKernelTagUserWired, P)};
+        const std::pair<const char*, uint64_t> counters[] = {
+            {"MemTotal", 1000000}, {"MemFree", 500000},       {"Buffers", 1000},          {"Cached", 50000},
+            {"Mapped", 20000},     {"PageTables", 2 * P},     {"Hugetlb", 40000},         {"HugePages_Total", 40000},
+            {"HugePages_Free", 10000}, {"Zswap", 3000}};
+        for (const auto& [counter, value] : counters) kernel.sites.push_back(counterRecord(counter, value));
+    }
+    void TearDown() override { RKAnalysisSettings::resetCache(); }
+
+    RKProcessList gathered() {
+        RKAnalysisSettings::resetCache();
+        RKProcessList list{RKProcess::processWithPid(0), RKProcess::processWithPid(7)};
+        for (const auto& process : list) process->gatherData();
+        // Two processes that share one object, and one that could not be read.
+        list.push_back(makeProcess(10, {region(0x8000000000000001ull, 0, 4 * P, P)}));
+        list.push_back(makeProcess(11, {region(0x8000000000000001ull, 0, 4 * P, P)}));
+        auto unreadable = makeProcess(12, {region(0x8000000000000002ull, 0, 8 * P, 8 * P)});
+        unreadable->addError("gone");
+        list.push_back(unreadable);
+        return list;
+    }
+
+    std::shared_ptr<RKScriptedPlatform> platform = std::make_shared<RKScriptedPlatform>();
+    RKScopedPlatform scope{platform};
+};
+
+TEST_F(RKSystemMemoryTest, TermsAddUpToMemTotalWithEveryByteInOneTerm) {
+    RKMemspread memspread(gathered());
+    memspread.analyzeData();
+    RKSystemMemory system = RKAccountForSystemMemory(memspread.processes(), true);
+    ASSERT_TRUE(system.map);
+    const RKAuxDataMap& map = *system.map;
+    EXPECT_EQ(leaf(map, "MemTotal"), 1000000);
+    EXPECT_EQ(leaf(map, "free"), 500000);
+    EXPECT_EQ(leaf(map, "processes"), int64_t(4 * P + 2 * P + P)) << "the shared object once, the tool and its page table";
+    EXPECT_EQ(leaf(map, "kernel"), int64_t(10000 + 2 * P - P)) << "user-wired memory and the tool's page table left out";
+    EXPECT_EQ(leaf(map, "page cache (not mapped)"), 1000 + 50000 - 20000);
+    EXPECT_EQ(leaf(map, "huge pages (free)"), 10000);
+    EXPECT_EQ(leaf(map, "compressed swap pool"), 3000);
+    int64_t sum = 0;
+    for (const auto& [key, node] : map.entries())
+        if (key != "MemTotal") sum += std::static_pointer_cast<const RKAuxData>(node)->value();
+    EXPECT_EQ(sum, 1000000);
+    EXPECT_EQ(map.entries().rbegin()->first, "unattributed") << "the last term";
+    EXPECT_EQ(system.unreadableProcesses, 1u);
+
+    // Without the kernel's figures there is nothing to account with.
+    RKProcessList users(memspread.processes().begin() + 1, memspread.processes().end());
+    EXPECT_FALSE(RKAccountForSystemMemory(users, true).map);
+}
+
+// Keeps the report-wide aux data it is given.
+class RKGlobalAuxRecorder : public RKRecordingFormatter {
+public:
+    void printGlobalAuxData(const std::shared_ptr<RKAuxDataMap>& auxData) override {
+        RKRecordingFormatter::printGlobalAuxData(auxData);
+        global = auxData;
+    }
+    std::shared_ptr<RKAuxDataMap> global;
+};
+
+TEST_F(RKSystemMemoryTest, OnlyARunOverEveryProcessReportsTheMapAndTheUnreadableOnes) {
+    for (bool whole : {false, true}) {
+        auto recorder = std::make_shared<RKGlobalAuxRecorder>();
+        RKMemspread memspread(gathered());
+        memspread.setMeasuresWholeSystem(whole);
+        memspread.analyzeData();
+        memspread.addOutputFormatter(recorder);
+        memspread.printOutputVerbose(false, true);
+        const std::string calls = recorder->journalText();
+        EXPECT_EQ(recorder->global && recorder->global->objectForKey("system"), whole) << calls;
+        EXPECT_EQ(calls.find(" [1 processes could not be read") != std::string::npos, whole) << calls;
+    }
+}
+
+}  // namespace
