@@ -17,7 +17,10 @@ void RKSampleTimer::setTimer(uint64_t start, uint64_t interval) {
     interval_ = std::max<uint64_t>(interval, 1);
 }
 
-void RKSampleTimer::resume() { thread_ = std::thread([this] { run(); }); }
+void RKSampleTimer::resume() {
+    std::lock_guard<std::mutex> lock(threadMutex_);
+    thread_ = std::thread([this] { run(); });
+}
 
 void RKSampleTimer::cancel() {
     {
@@ -28,6 +31,7 @@ void RKSampleTimer::cancel() {
 }
 
 void RKSampleTimer::waitUntilIdle() {
+    std::lock_guard<std::mutex> lock(threadMutex_);
     if (thread_.joinable() && thread_.get_id() != std::this_thread::get_id()) thread_.join();
 }
 

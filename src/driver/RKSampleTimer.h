@@ -40,5 +40,6 @@ private:
     uint64_t next_ = 0;      // the next deadline
     uint64_t interval_ = 1;  // never 0: deadlines always move on
     bool cancelled_ = false;
+    std::mutex threadMutex_;  // a stop may race the start: SIGINT is routed before the timer starts
     std::thread thread_;
 };

@@ -3,7 +3,6 @@
 #include <gtest/gtest.h>
 
 #include <condition_variable>
-#include <deque>
 #include <mutex>
 #include <regex>
 #include <thread>
@@ -11,21 +10,18 @@
 #include "driver/RKSampleInterval.h"
 #include "driver/RKSampler.h"
 #include "platform/RKScriptedPlatform.h"
+#include "support/RKKeptArgv.h"
 
 namespace {
 
 constexpr uint64_t kSecond = 1000000000;
 
-// The arguments record of `memspread <arguments>`; command lines stay alive, as getopt wants.
+// The arguments record of `memspread <arguments>`.
 RKMemspreadArgs argsFor(std::vector<std::string> arguments) {
-    static std::deque<std::vector<std::string>> commandLines;
-    arguments.insert(arguments.begin(), "memspread");
-    std::vector<std::string>& kept = commandLines.emplace_back(std::move(arguments));
-    std::vector<char*> argv;
-    for (std::string& argument : kept) argv.push_back(argument.data());
-    argv.push_back(nullptr);
+    std::vector<char*> argv = RKKeptArgv(std::move(arguments));
     RKError error;
-    std::optional<RKMemspreadArgs> args = RKMemspreadArgs::initWithArgc(static_cast<int>(kept.size()), argv.data(), &error);
+    std::optional<RKMemspreadArgs> args =
+        RKMemspreadArgs::initWithArgc(static_cast<int>(argv.size() - 1), argv.data(), &error);
     EXPECT_TRUE(args.has_value()) << error.localizedDescription.value_or("");
     return std::move(*args);
 }
@@ -62,7 +58,8 @@ public:
     void printSharedCategories(const RKCategoryMap&, const RKProcessGroup&, const RKProcess&, bool,
                                const RKMemoryTotal&) override {}
     void printProcessAuxData(const std::shared_ptr<RKAuxDataMap>&) override {}
-    void printProcessesWithWarnings(const RKProcessList&, const RKProcessList&, const std::vector<std::string>&) override {}
+    void printProcessesWithWarnings(const RKProcessList&, const RKProcessList&,
+                                    const std::vector<std::string>&) override {}
     void printSummaryCategories(const RKCategoryMap&, const RKMemoryTotal&, bool) override {}
     void printGlobalAuxData(const std::shared_ptr<RKAuxDataMap>&) override {}
 

@@ -160,7 +160,8 @@ TEST(RKMetricsLog, EveryFinishedReportIsInTheFileAsJsonLines) {
     const char* check = R"(import json, sys
 records = [json.loads(line) for line in open(sys.argv[1], encoding="utf-8")]
 assert all(isinstance(r, dict) for r in records)
-print(len(records), [r["group"] for r in records if r.get("metric") == "gather_duration"], records[1]["variables"]["process"])
+durations = [r["group"] for r in records if r.get("metric") == "gather_duration"]
+print(len(records), durations, records[1]["variables"]["process"])
 )";
     RKCommandResult parsed = RKRunCommand({"python3", "-c", check, log.path});
     EXPECT_TRUE(parsed.exitedWith(0)) << parsed.standardError;
