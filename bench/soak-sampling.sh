@@ -6,14 +6,17 @@
 #   bench/soak-sampling.sh [BINARY] [OUTPUT_DIR]
 #
 # Environment: SOAK_EARLY (seconds to the first reading, default 300), SOAK_TOTAL (seconds to
-# the last, default 1800). The report goes to OUTPUT_DIR/soak.txt (default: a new temporary
-# directory); the samples themselves are discarded. memspread runs niced, so that the soak
-# shares the machine politely; niceness changes its pace, not what it holds.
+# the last, default 1800), SOAK_NICE (memspread's niceness, default 0). The report goes to
+# OUTPUT_DIR/soak.txt (default: a new temporary directory); the samples themselves are
+# discarded. On a machine busy with other work a high niceness starves the analysis thread
+# (niceness + 5), the interval grows far past 0.1 s and never shrinks, and the late reading
+# then shows memspread mostly at rest: keep the default unless the machine is idle.
 set -euo pipefail
 
 binary=${1:-build/src/memspread}
 out=${2:-$(mktemp -d /tmp/memspread-soak.XXXXXX)}
 early=${SOAK_EARLY:-300}
+niceness=${SOAK_NICE:-0}
 total=${SOAK_TOTAL:-1800}
 mkdir -p "$out"
 report="$out/soak.txt"
@@ -26,16 +29,17 @@ report="$out/soak.txt"
 # measured process), so the lowest value is memspread at rest and the highest one with a sample.
 range() { sort -n | awk 'NR == 1 {lo = $1} {hi = $1} END {print lo ".." hi}'; }
 reading() {
-    local label=$1 pid=$2 rss=() threads=() fds=() procs=()
+    local label=$1 pid=$2 rss=() threads=() fds=() procs=() hwm=
     for _ in $(seq 20); do
         rss+=("$(awk '/^VmRSS:/ {print $2}' "/proc/$pid/status")")
+        hwm=$(awk '/^VmHWM:/ {print $2}' "/proc/$pid/status")
         threads+=("$(awk '/^Threads:/ {print $2}' "/proc/$pid/status")")
         fds+=("$(ls "/proc/$pid/fd" | wc -l)")
         procs+=("$(compgen -G "/proc/[0-9]*" | wc -l)")
         sleep 0.25
     done
-    printf '%-6s t=%-6s rss_kb=%-18s fds=%-10s threads=%-6s processes=%s\n' "$label" \
-        "$(( $(date +%s) - started ))s" "$(printf '%s\n' "${rss[@]}" | range)" \
+    printf '%-6s t=%-6s rss_kb=%-18s hwm_kb=%-9s fds=%-10s threads=%-6s processes=%s\n' "$label" \
+        "$(( $(date +%s) - started ))s" "$(printf '%s\n' "${rss[@]}" | range)" "$hwm" \
         "$(printf '%s\n' "${fds[@]}" | range)" "$(printf '%s\n' "${threads[@]}" | range)" \
         "$(printf '%s\n' "${procs[@]}" | range)" | tee -a "$report"
 }
@@ -46,7 +50,7 @@ reading() {
 } > "$report"
 
 started=$(date +%s)
-nice -n 10 "$binary" --sample 0.1 -a > /dev/null 2> "$out/stderr.txt" &
+nice -n "$niceness" "$binary" --sample 0.1 -a > /dev/null 2> "$out/stderr.txt" &
 pid=$!
 trap 'kill -INT $pid 2>/dev/null || true' EXIT
 
@@ -68,7 +72,7 @@ trap - EXIT
     # Rest and peak figures of the late reading against the early one.
     awk '/^(early|late) / {
              for (i = 3; i <= NF; i++) {
-                 split($i, kv, "="); split(kv[2], r, /\.\./)
+                 split($i, kv, "="); if (split(kv[2], r, /\.\./) < 2) r[2] = r[1]
                  if (kv[1] == "processes") continue
                  if ($1 == "early") {lo[kv[1]] = r[1]; hi[kv[1]] = r[2]}
                  else if (lo[kv[1]] > 0 && hi[kv[1]] > 0)
