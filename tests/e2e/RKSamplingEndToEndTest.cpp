@@ -4,8 +4,11 @@
 #include <signal.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <filesystem>
+#include <fstream>
+#include <iterator>
 #include <regex>
 #include <string>
 #include <thread>
@@ -45,6 +48,20 @@ size_t countOf(const std::string& text, const std::regex& pattern) {
 // The text after the last "Time:" line: the last sample's report.
 std::string lastSample(const std::string& text) { return text.substr(text.rfind("Time: ")); }
 
+// Samples finished in the metrics log at `path`, which is written sample by sample.
+size_t samplesIn(const fs::path& path) {
+    std::ifstream file(path);
+    std::string text{std::istreambuf_iterator<char>(file), {}};
+    return countOf(text, std::regex("\"gather_duration\""));
+}
+
+// Waits until the log holds `count` samples; false after a minute (a loaded machine is slow, not
+// that slow).
+bool waitForSamples(const fs::path& log, size_t count) {
+    for (int i = 0; i < 6000 && samplesIn(log) < count; i++) std::this_thread::sleep_for(10ms);
+    return samplesIn(log) >= count;
+}
+
 }  // namespace
 
 TEST(RKSamplingEndToEnd, StopsOnSigintWithTheSameSamplesInEveryOutputAndDropsAnExitedTarget) {
@@ -57,9 +74,11 @@ TEST(RKSamplingEndToEnd, StopsOnSigintWithTheSameSamplesInEveryOutputAndDropsAnE
         {MEMSPREAD_BINARY, "--sample", "0.25", "-j", json.string(), "--metrilog", log.string(),
          std::to_string(staying.pid()), gone},
         120s, [&](pid_t memspread) {
-            std::this_thread::sleep_for(1s);
+            // About two seconds on an idle machine. Two samples after the exit make sure that one
+            // was gathered wholly after it.
+            waitForSamples(log, 2);
             leaving.stop();
-            std::this_thread::sleep_for(1s);
+            waitForSamples(log, std::max<size_t>(4, samplesIn(log) + 2));
             kill(memspread, SIGINT);
         });
     staying.stop();
@@ -93,13 +112,15 @@ TEST(RKSamplingEndToEnd, StopsOnSigintWithTheSameSamplesInEveryOutputAndDropsAnE
 TEST(RKSamplingEndToEnd, AllProcessesTakesInAProcessStartedWhileSampling) {
     RKFixtureProcess late;
     bool started = false;
-    RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, "--sample", "0.25", "-a"}, 120s, [&](pid_t memspread) {
-        std::this_thread::sleep_for(1s);
-        started = late.start(MEMSPREAD_FIXTURE);
-        // Generous: a sample of every process on a loaded machine may take a second or more.
-        if (started) std::this_thread::sleep_for(5s);
-        kill(memspread, SIGINT);
-    });
+    const fs::path log = temporary("all.mlj");
+    RKCommandResult run = RKRunCommand(
+        {MEMSPREAD_BINARY, "--sample", "0.25", "--metrilog", log.string(), "-a"}, 180s, [&](pid_t memspread) {
+            waitForSamples(log, 1);
+            started = late.start(MEMSPREAD_FIXTURE);
+            if (started) waitForSamples(log, samplesIn(log) + 2);
+            kill(memspread, SIGINT);
+        });
+    fs::remove(log);
     const std::string marker = "[" + std::to_string(late.pid()) + "]:";
     late.stop();
     ASSERT_TRUE(started) << late.error();
