@@ -105,6 +105,8 @@ std::optional<RKTargetMap> RKSampler::_resolveTargets() {
 // A user process whose phys_memspread did not move since the previous sample is taken over with
 // what was gathered for it, instead of being gathered again. Only possible while the previous
 // sample is still held (queued or in analysis); its analysis and the next one never overlap.
+// The lowest pid is always gathered afresh: a gather cut short by SIGINT writes its early-exit
+// error into that process, which the previous sample's analysis may be reading.
 void RKSampler::_carryOverUnchangedProcesses(RKTargetMap& targets) {
     std::shared_ptr<RKMemspread> previous;
     {
@@ -116,7 +118,7 @@ void RKSampler::_carryOverUnchangedProcesses(RKTargetMap& targets) {
         const RKUserProcess* oldUser = asUserProcess(old);
         if (!oldUser) continue;
         auto entry = targets.find(old->pid());
-        if (entry == targets.end()) continue;
+        if (entry == targets.end() || entry == targets.begin()) continue;
         const RKUserProcess* fresh = asUserProcess(entry->second);
         if (fresh && fresh->phys_memspread() == oldUser->phys_memspread()) entry->second = old;
     }

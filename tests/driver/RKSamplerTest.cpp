@@ -114,10 +114,11 @@ TEST(RKSampler, SlowSamplesStretchTheIntervalOnceWithAWarning) {
 
 TEST(RKSampler, AnUnchangedProcessIsCarriedOverWhileItsSampleIsStillInAnalysis) {
     auto platform = std::make_shared<RKScriptedPlatform>();
+    platform->addProcess(100, "lowest");  // never carried over: a cancelled gather writes into it
     platform->addProcess(200, "steady");
     platform->addProcess(300, "growing").physMemspreadGrowth = 4096;
     RKScopedPlatform scope(platform);
-    RKMemspreadArgs args = argsFor({"--sample", "0.5", "200", "300"});
+    RKMemspreadArgs args = argsFor({"--sample", "0.5", "100", "200", "300"});
     auto formatter = std::make_shared<GatedFormatter>(false);
     RKOutputFormatterList formatters{formatter};
 
@@ -133,5 +134,6 @@ TEST(RKSampler, AnUnchangedProcessIsCarriedOverWhileItsSampleIsStillInAnalysis) 
     testing::internal::GetCapturedStderr();
     EXPECT_GE(formatter->reports(), 3u);
     EXPECT_EQ(platform->callCount("regionRecurse 200"), 1u);
+    EXPECT_GE(platform->callCount("regionRecurse 100"), 3u);
     EXPECT_GE(platform->callCount("regionRecurse 300"), 3u);
 }
