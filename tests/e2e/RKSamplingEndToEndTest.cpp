@@ -56,7 +56,7 @@ size_t samplesIn(const fs::path& path) {
 }
 
 // Waits until the log holds `count` samples; false after a minute (a loaded machine is slow, not
-// that slow).
+// that slow). With the minute memspread is given to finish after SIGINT, a test ends in three.
 bool waitForSamples(const fs::path& log, size_t count) {
     for (int i = 0; i < 6000 && samplesIn(log) < count; i++) std::this_thread::sleep_for(10ms);
     return samplesIn(log) >= count;
@@ -73,7 +73,7 @@ TEST(RKSamplingEndToEnd, StopsOnSigintWithTheSameSamplesInEveryOutputAndDropsAnE
     RKCommandResult run = RKRunCommand(
         {MEMSPREAD_BINARY, "--sample", "0.25", "-j", json.string(), "--metrilog", log.string(),
          std::to_string(staying.pid()), gone},
-        120s, [&](pid_t memspread) {
+        60s, [&](pid_t memspread) {
             // About two seconds on an idle machine. Two samples after the exit make sure that one
             // was gathered wholly after it.
             waitForSamples(log, 2);
@@ -114,7 +114,7 @@ TEST(RKSamplingEndToEnd, AllProcessesTakesInAProcessStartedWhileSampling) {
     bool started = false;
     const fs::path log = temporary("all.mlj");
     RKCommandResult run = RKRunCommand(
-        {MEMSPREAD_BINARY, "--sample", "0.25", "--metrilog", log.string(), "-a"}, 180s, [&](pid_t memspread) {
+        {MEMSPREAD_BINARY, "--sample", "0.25", "--metrilog", log.string(), "-a"}, 60s, [&](pid_t memspread) {
             waitForSamples(log, 1);
             started = late.start(MEMSPREAD_FIXTURE);
             if (started) waitForSamples(log, samplesIn(log) + 2);
