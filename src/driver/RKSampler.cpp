@@ -54,6 +54,11 @@ void RKSampler::stop() {
     stopped_.release();
 }
 
+bool RKSampler::stopRequested() {
+    std::lock_guard<std::mutex> lock(currentMutex_);
+    return stopping_;
+}
+
 void RKSampler::waitForStop() { stopped_.acquire(); }
 
 void RKSampler::drain() {

@@ -37,6 +37,8 @@ public:
     // Blocks until every sample handed to the analysis queue has been written.
     void drain();
 
+    // Whether stop() has begun: from then on no sample starts gathering.
+    bool stopRequested();
     // Samples handed to the analysis queue so far.
     uint64_t samplesQueued() const { return samplesQueued_.load(); }
 

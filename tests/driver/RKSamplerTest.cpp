@@ -126,8 +126,10 @@ TEST(RKSampler, AnUnchangedProcessIsCarriedOverWhileItsSampleIsStillInAnalysis) 
     RKSampler sampler(args, formatters);
     sampler.start();
     waitForSamples(sampler, 3);  // the first is held in analysis; two more wait behind it
-    // Stopping waits for the tick in progress, which may be waiting for room in the queue.
+    // Stopping waits for the tick in progress, which may be waiting for room in the queue. The
+    // held sample is let go only once no further tick can start, or one might gather afresh.
     std::thread stopper([&] { sampler.stop(); });
+    while (!sampler.stopRequested()) std::this_thread::sleep_for(std::chrono::milliseconds(1));
     formatter->open();
     stopper.join();
     sampler.drain();
