@@ -11,10 +11,7 @@
 #include <thread>
 #include <vector>
 
-namespace {
-
-// Lowers the calling thread's priority; never raises it (that needs privilege).
-void addNiceness(int increment) {
+void RKAddThreadNiceness(int increment) {
     if (increment <= 0) return;
     id_t tid = static_cast<id_t>(::syscall(SYS_gettid));
     errno = 0;
@@ -22,8 +19,6 @@ void addNiceness(int increment) {
     if (current == -1 && errno != 0) return;
     ::setpriority(PRIO_PROCESS, tid, std::min(current + increment, 19));
 }
-
-}  // namespace
 
 size_t RKOnlineCpuCount() {
     long cpus = ::sysconf(_SC_NPROCESSORS_ONLN);
@@ -33,7 +28,7 @@ size_t RKOnlineCpuCount() {
 void RKParallelApply(size_t count, const RKWorkerPoolOptions& options, const std::function<void(size_t)>& work) {
     std::atomic<size_t> next{0};
     auto worker = [&] {
-        addNiceness(options.niceIncrement);
+        RKAddThreadNiceness(options.niceIncrement);
         for (size_t i; (i = next.fetch_add(1)) < count;) work(i);
     };
     std::vector<std::thread> workers;

@@ -12,5 +12,8 @@ struct RKWorkerPoolOptions {
 
 void RKParallelApply(size_t count, const RKWorkerPoolOptions& options, const std::function<void(size_t)>& work);
 
+// Lowers the calling thread's priority by `increment`; never raises it (that needs privilege).
+void RKAddThreadNiceness(int increment);
+
 // One worker per online CPU.
 size_t RKOnlineCpuCount();

@@ -1,16 +1,23 @@
-// The measurement as named numeric metrics in a metrics-log file (--metrilog). One group of
-// values per process and one summary group per report; the file is complete once close() ran.
+// The measurement as named numeric metrics in a metrics-log file (--metrilog): one group of
+// values per process and one summary group per report, written through the metrics-log writer
+// (docs/metrics-log.md). Every report reaches the file by its end, so a log of a sampling run
+// cut short is complete up to the last sample written.
 #pragma once
 
-#include <cstdio>
+#include <cstdint>
+#include <map>
 #include <memory>
+#include <optional>
 #include <string>
 
+#include "model/RKAuxData.h"
+#include "model/RKTime.h"
+#include "output/RKMetricsLogWriter.h"
 #include "output/RKOutputFormatter.h"
 
 class RKOutputFormatterMetrilog : public RKOutputFormatter {
 public:
-    // initWithPath: opens or creates the log. When it cannot be opened, writes
+    // initWithPath: creates the log anew. When it cannot be opened, writes
     // "Unable to open mlwriter: <system error>" to standard error and returns nullptr. The log is
     // named after the accounting mode in force when it is opened.
     static std::shared_ptr<RKOutputFormatterMetrilog> initWithPath(const std::string& path);
@@ -40,22 +47,26 @@ public:
     bool implementsClose() const override { return true; }
     void close() override;
 
-    const std::string& logName() const { return logName_; }
-    bool isOpen() const { return file_ != nullptr; }
-
-    struct FileCloser {
-        void operator()(FILE* file) const { std::fclose(file); }
-    };
-    using File = std::unique_ptr<FILE, FileCloser>;
+    bool isOpen() const { return writer_ != nullptr; }
 
 private:
     struct Opened {};  // only initWithPath constructs
 
 public:
-    RKOutputFormatterMetrilog(Opened, File file, std::string logName)
-        : file_(std::move(file)), logName_(std::move(logName)) {}
+    RKOutputFormatterMetrilog(Opened, mlwriter_t writer) : writer_(writer) {}
+    ~RKOutputFormatterMetrilog() override;
+    RKOutputFormatterMetrilog(const RKOutputFormatterMetrilog&) = delete;
+    RKOutputFormatterMetrilog& operator=(const RKOutputFormatterMetrilog&) = delete;
 
 private:
-    File file_;
-    std::string logName_;
+    void _addCategories(const RKCategoryMap& categories);
+    void _emitAuxData(const RKAuxDataType* node, const std::string& parentName, const std::string& processName);
+
+    mlwriter_t writer_;
+    // The name of the process whose group is open; its values are recorded under it.
+    std::string currentProcess_;
+    // The open process's memspread per category full name, own and shared memory summed; none
+    // before its own categories arrived.
+    std::optional<std::map<std::string, uint64_t>> currentProcessTotals_;
+    std::optional<RKTime> startTime_;
 };

@@ -8,6 +8,7 @@
 
 #include <atomic>
 #include <cerrno>
+#include <chrono>
 
 #include "platform/RKLinuxTask.h"
 
@@ -77,6 +78,20 @@ bool RKLinuxPlatform::getTimes(RKClockReadings& readings) {
 }
 
 RKTimebase RKLinuxPlatform::timebase() { return RKTimebase{1, 1}; }
+
+uint64_t RKLinuxPlatform::uptimeNanoseconds() {
+    timespec monotonic{};
+    clock_gettime(CLOCK_MONOTONIC, &monotonic);  // cannot fail for this clock
+    return nanoseconds(monotonic);
+}
+
+// steady_clock is CLOCK_MONOTONIC, the uptime clock, so the wait ends at the deadline itself.
+void RKLinuxPlatform::waitForUptime(uint64_t deadline, std::condition_variable& wake,
+                                    std::unique_lock<std::mutex>& lock) {
+    uint64_t now = uptimeNanoseconds();
+    if (now >= deadline) return;
+    wake.wait_for(lock, std::chrono::nanoseconds(deadline - now));
+}
 
 uint64_t RKLinuxPlatform::kernelPageSize() {
     static const uint64_t pageSize = static_cast<uint64_t>(::sysconf(_SC_PAGESIZE));

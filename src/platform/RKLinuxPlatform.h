@@ -47,6 +47,9 @@ public:
     int writeSelfRegionMemspread(int32_t value) override;
     bool getTimes(RKClockReadings& readings) override;
     RKTimebase timebase() override;
+    uint64_t uptimeNanoseconds() override;
+    void waitForUptime(uint64_t deadline, std::condition_variable& wake,
+                       std::unique_lock<std::mutex>& lock) override;
     uint64_t kernelPageSize() override;
     uid_t effectiveUserId() override;
     pid_t ownPid() override;

@@ -11,8 +11,10 @@
 
 #include <sys/types.h>
 
+#include <condition_variable>
 #include <cstdint>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
@@ -97,6 +99,13 @@ public:
     // mach_get_times: false when the clocks cannot be read.
     virtual bool getTimes(RKClockReadings& readings) = 0;
     virtual RKTimebase timebase() = 0;
+    // clock_gettime_nsec_np(CLOCK_UPTIME_RAW_APPROX): monotonic nanoseconds that stand still
+    // while the machine sleeps; the sampling timer's clock.
+    virtual uint64_t uptimeNanoseconds() = 0;
+    // The sampling timer's wait: returns once the uptime clock reads `deadline`, when `wake` is
+    // notified, or spuriously. `lock` is held on entry and on return, as for a condition wait.
+    virtual void waitForUptime(uint64_t deadline, std::condition_variable& wake,
+                               std::unique_lock<std::mutex>& lock) = 0;
     virtual uint64_t kernelPageSize() = 0;
     virtual uid_t effectiveUserId() = 0;
     virtual pid_t ownPid() = 0;

@@ -94,6 +94,11 @@ const RKScriptedRegion* RKScriptedPlatform::regionAtOrAbove(pid_t pid, uint64_t 
 kern_return_t RKScriptedPlatform::regionRecurse(RKTask& task, uint64_t& address, uint64_t& size,
                                                 RKRegionSubmapInfo& info, uint32_t& count) {
     record("regionRecurse", task.pid());
+    if (address == 0) {
+        auto* process = find(task.pid());
+        std::lock_guard<std::mutex> lock(mutex_);
+        if (process) uptime += process->walkNanoseconds;
+    }
     const auto* region = regionAtOrAbove(task.pid(), address);
     if (!region) {
         auto* process = find(task.pid());
@@ -155,6 +160,8 @@ int RKScriptedPlatform::pidRusage(RKTask& task, RKRusageInfo& info) {
     auto* process = find(task.pid());
     if (!process) return ESRCH;
     if (process->rusageErrno != 0) return process->rusageErrno;
+    std::lock_guard<std::mutex> lock(mutex_);
+    process->rusage.ri_phys_memspread += process->physMemspreadGrowth;
     info = process->rusage;
     return 0;
 }
@@ -223,6 +230,16 @@ bool RKScriptedPlatform::getTimes(RKClockReadings& readings) {
 RKTimebase RKScriptedPlatform::timebase() {
     record("timebase");
     return base;
+}
+
+uint64_t RKScriptedPlatform::uptimeNanoseconds() {
+    std::lock_guard<std::mutex> lock(mutex_);
+    return uptime;
+}
+
+void RKScriptedPlatform::waitForUptime(uint64_t deadline, std::condition_variable&, std::unique_lock<std::mutex>&) {
+    std::lock_guard<std::mutex> lock(mutex_);
+    uptime = std::max(uptime, deadline);
 }
 
 uint64_t RKScriptedPlatform::kernelPageSize() { return pageSize; }

@@ -42,6 +42,11 @@ struct RKScriptedProcess {
     std::vector<int64_t> ledgerBalances;  // in template order; entries not given answer 0
     int ownedErrno = ENOENT;
     std::vector<RKOwnedVmObjectRecord> owned;
+    // How long a region walk of this process takes: the uptime clock moves on by this much when
+    // the walk starts (at address 0), so a test can make a gather slow without waiting for it.
+    uint64_t walkNanoseconds = 0;
+    // Added to rusage's phys_memspread at every read: a process whose memory keeps moving.
+    uint64_t physMemspreadGrowth = 0;
 };
 
 class RKScriptedTask : public RKTask {
@@ -65,6 +70,9 @@ public:
     RKClockReadings clocks;
     bool clocksFail = false;
     RKTimebase base{1, 1};
+    // The uptime clock. Scripted time passes only when something makes it: a walk that takes
+    // time, or a wait for a deadline, which jumps the clock there at once.
+    uint64_t uptime = 0;
     std::vector<std::string> ledgerNames{"page_table"};
     int ledgerTemplateErrno = 0;
     int32_t selfRegionValue = 0;
@@ -110,6 +118,9 @@ public:
     int writeSelfRegionMemspread(int32_t value) override;
     bool getTimes(RKClockReadings& readings) override;
     RKTimebase timebase() override;
+    uint64_t uptimeNanoseconds() override;
+    void waitForUptime(uint64_t deadline, std::condition_variable& wake,
+                       std::unique_lock<std::mutex>& lock) override;
     uint64_t kernelPageSize() override;
     uid_t effectiveUserId() override;
     pid_t ownPid() override;

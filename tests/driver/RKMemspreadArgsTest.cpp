@@ -2,11 +2,11 @@
 // end to end; here: what the options set, which errors win, and getopt's state between parses.
 #include <gtest/gtest.h>
 
-#include <deque>
 #include <string>
 #include <vector>
 
 #include "driver/RKMemspreadArgs.h"
+#include "support/RKKeptArgv.h"
 
 namespace {
 
@@ -16,19 +16,13 @@ struct Parsed {
     std::string standardError;
 };
 
-// Parses `memspread <arguments>` in-process, capturing what the parser printed. Every command
-// line stays alive to the end of the test program: getopt keeps pointers into the last one, and a
-// parser that does not reset it must then misread the next line rather than read freed memory.
+// Parses `memspread <arguments>` in-process, capturing what the parser printed. A parser that
+// does not reset getopt must then misread the next line rather than read freed memory.
 Parsed parse(std::vector<std::string> arguments) {
-    static std::deque<std::vector<std::string>> commandLines;
-    arguments.insert(arguments.begin(), "memspread");
-    std::vector<std::string>& kept = commandLines.emplace_back(std::move(arguments));
-    std::vector<char*> argv;
-    for (std::string& argument : kept) argv.push_back(argument.data());
-    argv.push_back(nullptr);
+    std::vector<char*> argv = RKKeptArgv(std::move(arguments));
     Parsed parsed;
     testing::internal::CaptureStderr();
-    parsed.args = RKMemspreadArgs::initWithArgc(static_cast<int>(kept.size()), argv.data(), &parsed.error);
+    parsed.args = RKMemspreadArgs::initWithArgc(static_cast<int>(argv.size() - 1), argv.data(), &parsed.error);
     parsed.standardError = testing::internal::GetCapturedStderr();
     return parsed;
 }

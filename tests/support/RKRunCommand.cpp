@@ -39,7 +39,8 @@ int reap(pid_t child, std::chrono::milliseconds timeout) {
 
 }  // namespace
 
-RKCommandResult RKRunCommand(const std::vector<std::string>& argv, std::chrono::milliseconds timeout) {
+RKCommandResult RKRunCommand(const std::vector<std::string>& argv, std::chrono::milliseconds timeout,
+                             const std::function<void(pid_t)>& whileRunning) {
     RKCommandResult result;
     CaptureFile out;
     CaptureFile err;
@@ -58,6 +59,7 @@ RKCommandResult RKRunCommand(const std::vector<std::string>& argv, std::chrono::
     posix_spawn_file_actions_destroy(&actions);
     if (!result.started) return result;
 
+    if (whileRunning) whileRunning(child);
     int status = reap(child, timeout);
     if (WIFEXITED(status)) result.exitStatus = WEXITSTATUS(status);
     result.standardOutput = out.contents();
