@@ -5,6 +5,7 @@
 #include "model/RKMemoryCategory.h"
 #include "model/RKMemoryObject.h"
 #include "model/RKProcessGroup.h"
+#include "process/RKUnreadProcess.h"
 
 namespace {
 
@@ -57,6 +58,10 @@ void RKMemspread::printOutputVerbose(bool verbose, bool summarize) {
 
     ReportState report;
     for (const auto& process : reported) _printReportedProcess(process, groups, summarize, report);
+    // Processes that could not be opened are never shown, but the run names them.
+    for (const auto& process : processes_) {
+        if (dynamic_cast<const RKUnreadProcess*>(process.get())) report.withWarnings.push_back(process);
+    }
     for (const auto& formatter : outputFormatters_) {
         formatter->printProcessesWithWarnings(report.withWarnings, report.withErrors, report.globalErrors);
     }

@@ -42,6 +42,10 @@ struct RKScriptedProcess {
     std::vector<int64_t> ledgerBalances;  // in template order; entries not given answer 0
     int ownedErrno = ENOENT;
     std::vector<RKOwnedVmObjectRecord> owned;
+    // Set when the pid has been reused since the listing: a task opened on it then reads this
+    // other process's record and executable path.
+    std::optional<RKBsdInfo> reusedBy;
+    std::optional<std::string> reusedByExecutablePath;
 };
 
 class RKScriptedTask : public RKTask {
@@ -87,6 +91,8 @@ public:
     std::optional<std::string> executablePath(pid_t pid) override;
     uint32_t dirtyFlags(pid_t pid) override;
     kern_return_t taskForPid(pid_t pid, std::unique_ptr<RKTask>& task) override;
+    std::optional<RKBsdInfo> taskBsdInfo(RKTask& task) override;
+    std::optional<std::string> taskExecutablePath(RKTask& task) override;
     bool hasSharedRegion() override;
     kern_return_t regionRecurse(RKTask& task, uint64_t& address, uint64_t& size,
                                 RKRegionSubmapInfo& info, uint32_t& count) override;

@@ -49,6 +49,7 @@ RKRegionSubmapInfo sharedRegionRecord(const RKRegionBasicInfo& basic) {
 
 void RKUserProcess::gatherData() {
     if (memoryRegions()) return;
+    if (!_reopenTaskForGathering()) return;
     if (!hiddenFromDisplay()) {
         _gatherImageData();
         _gatherPhysMemspread();
@@ -56,6 +57,7 @@ void RKUserProcess::gatherData() {
     }
     _gatherMemoryData();
     images_.reset();
+    _releaseTask();
 }
 
 uint64_t RKUserProcess::_lastNonSharedCacheRegion() {
@@ -301,7 +303,9 @@ void RKUserProcess::_processMachVMError(kern_return_t error, kern_return_t expec
     bool zombie = false;
     if (error == expected && _isAlive()) {
         uint32_t status = 0;
-        int result = RKPlatform::current().shortBsdInfoStatus(pid(), status);
+        // Through the task: the pid may already name another process.
+        int result = task_ ? RKPlatform::current().taskShortBsdInfoStatus(*task_, status)
+                           : RKPlatform::current().shortBsdInfoStatus(pid(), status);
         exited = result == ESRCH;
         if (result == 0 && status == SZOMB) {
             zombie = true;
