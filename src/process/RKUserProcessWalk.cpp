@@ -5,6 +5,7 @@
 #include <cstring>
 
 #include "model/RKAssert.h"
+#include "model/RKEscapedText.h"
 #include "model/RKMemoryRegion.h"
 #include "process/RKAnalysisSettings.h"
 #include "process/RKUserProcess.h"
@@ -21,7 +22,8 @@ constexpr uint64_t kCarveoutStart = 0x1000000000;
 constexpr uint64_t kCarveoutSize = 0x6000000000;
 
 void printBailingOut(const std::string& displayString) {
-    std::fprintf(stderr, "bailing out for process %s; data may be incomplete!\n", displayString.c_str());
+    std::fprintf(stderr, "bailing out for process %s; data may be incomplete!\n",
+                 RKEscapedText(displayString).c_str());
 }
 
 // strerror_r comes in two flavours; both end up as text here.
@@ -323,7 +325,7 @@ void RKUserProcess::_addErrnoWarningWithDescription(const std::string& descripti
     char buffer[256] = {};
     const char* text = errnoText(strerror_r(error, buffer, sizeof buffer), buffer);
     std::string message = displayString() + ": " + description + " - " + text;
-    std::fprintf(stderr, "%s\n", message.c_str());
+    std::fprintf(stderr, "%s\n", RKEscapedText(message).c_str());
     warnings_.push_back(std::move(message));
 }
 
