@@ -48,9 +48,10 @@ RKDescriptorBudget& RKDescriptorBudget::shared() {
     return budget;
 }
 
-RKDescriptorTicket RKDescriptorBudget::acquire() {
+RKDescriptorTicket RKDescriptorBudget::acquire(bool* timedOut) {
     std::unique_lock<std::mutex> lock(mutex_);
-    released_.wait_for(lock, patience_, [this] { return inUse_ < capacity_; });
+    const bool free = released_.wait_for(lock, patience_, [this] { return inUse_ < capacity_; });
+    if (timedOut) *timedOut = !free;
     inUse_++;
     return RKDescriptorTicket(this);
 }

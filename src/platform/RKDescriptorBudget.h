@@ -41,7 +41,9 @@ public:
     // Slots for a soft limit of `limit` descriptors.
     static size_t capacityForLimit(unsigned long long limit);
 
-    RKDescriptorTicket acquire();
+    // Waits for a free slot; `timedOut`, when given, tells whether the wait ran out of patience
+    // (the slot is then over budget).
+    RKDescriptorTicket acquire(bool* timedOut = nullptr);
     // An open failed for want of descriptors while `ticket` was held. Returns false when no
     // other slot is held (no one will give a descriptor back: the failure is final); otherwise
     // gives the ticket back, lowers the capacity below what is held now and returns true (the

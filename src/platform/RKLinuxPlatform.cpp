@@ -49,7 +49,8 @@ kern_return_t RKLinuxPlatform::taskForPid(pid_t pid, std::unique_ptr<RKTask>& ta
     std::string path = procRoot_ + "/" + std::to_string(pid);
     RKDescriptorBudget& budget = RKDescriptorBudget::shared();
     for (;;) {
-        RKDescriptorTicket ticket = budget.acquire();
+        bool overBudget = false;
+        RKDescriptorTicket ticket = budget.acquire(&overBudget);
         RKUniqueFd directory(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
         // Opening smaps is the kernel's ptrace-read check: without it nothing can be measured.
         RKUniqueFd smaps;
@@ -59,8 +60,10 @@ kern_return_t RKLinuxPlatform::taskForPid(pid_t pid, std::unique_ptr<RKTask>& ta
             return KERN_SUCCESS;
         }
         const int error = errno;
-        // Out of descriptors while other tasks are open: wait for one of them to close.
-        if ((error == EMFILE || error == ENFILE) && budget.shrinkAfterFailure(ticket)) continue;
+        // Out of descriptors while other tasks are open: wait for one of them to close. Not when
+        // the wait already ran out: the holders may be this very thread.
+        const bool outOfDescriptors = error == EMFILE || error == ENFILE;
+        if (outOfDescriptors && !overBudget && budget.shrinkAfterFailure(ticket)) continue;
         return openFailure(error);
     }
 }
