@@ -115,8 +115,8 @@ TEST(RKAllProcesses, OtherProcessesNamesNeverReachATerminalRaw) {
 }
 
 // Runs -a for MEMSPREAD_CHURN_SECONDS (default 40) while the churn helper forks, execs and reaps a
-// few hundred processes a second. Every run must end by itself with a complete report and a
-// document that parses and holds the churning parent.
+// few hundred processes a second. Every run must end by itself (each is bounded) with exit 0, a
+// complete report and a document that parses and holds the churning parent.
 TEST(RKAllProcesses, CompleteReportWhileProcessesComeAndGo) {
     if (geteuid() != 0) GTEST_SKIP() << "-a needs root";
     const char* setting = std::getenv("MEMSPREAD_CHURN_SECONDS");
@@ -127,9 +127,14 @@ TEST(RKAllProcesses, CompleteReportWhileProcessesComeAndGo) {
     const auto end = std::chrono::steady_clock::now() + duration;
     int runs = 0;
     while (std::chrono::steady_clock::now() < end) {
-        RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, "-a", "-j", document.string()}, 60s);
+        // A run takes a second or two; the bound is for a loaded machine and only stops a hang.
+        RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, "-a", "-j", document.string()}, 120s);
         runs++;
-        ASSERT_TRUE(run.exitedWith(0)) << "run " << runs << " did not exit 0 within a minute:\n" << run.standardError;
+        ASSERT_TRUE(run.started) << "run " << runs << " could not be started";
+        ASSERT_TRUE(run.exitedWith(0)) << "run " << runs << " did not exit 0 within two minutes ("
+                                       << (run.exitStatus ? "status " + std::to_string(*run.exitStatus)
+                                                          : std::string("killed or timed out"))
+                                       << "):\n" << run.standardError;
         ASSERT_NE(run.standardOutput.find("Summary Memspread:"), std::string::npos) << "run " << runs;
         auto measured = measuredPids(document);
         ASSERT_TRUE(measured) << "run " << runs << ": the document does not parse";
