@@ -4,6 +4,8 @@ memspread_packages=(cmake g++ make libbsd-dev libgtest-dev libgmock-dev libbench
 # The Debian package (dpkg-shlibdeps; CPack's DEB generator runs file) and the checks of the man
 # page and the bash completion.
 memspread_packages+=(dpkg-dev file groff-base bash-completion)
+# The fuzzers build with clang and its libFuzzer.
+memspread_packages+=(clang libfuzzer-14-dev libclang-rt-14-dev)
 
 # Installs the packages that are missing. apt-get runs only when something is missing, so a
 # prepared machine builds without network or root.

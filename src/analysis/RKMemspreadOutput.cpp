@@ -6,6 +6,7 @@
 #include "model/RKMemoryCategory.h"
 #include "model/RKMemoryObject.h"
 #include "model/RKProcessGroup.h"
+#include "process/RKUnreadProcess.h"
 
 namespace {
 
@@ -60,6 +61,10 @@ void RKMemspread::printOutputVerbose(bool verbose, bool summarize) {
     ReportState report;
     for (const auto& process : reported) _printReportedProcess(process, groups, summarize, report);
     if (measuresWholeSystem_) _addSystemMemory(report);
+    // Processes that could not be opened are never shown, but the run names them.
+    for (const auto& process : processes_) {
+        if (dynamic_cast<const RKUnreadProcess*>(process.get())) report.withWarnings.push_back(process);
+    }
     for (const auto& formatter : outputFormatters_) {
         if (!report.globalWarnings.empty() && formatter->implementsPrintGlobalWarnings())
             formatter->printGlobalWarnings(report.globalWarnings);

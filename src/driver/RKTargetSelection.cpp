@@ -7,6 +7,7 @@
 #include <string_view>
 
 #include "driver/RKMemspreadArgs.h"
+#include "model/RKEscapedText.h"
 #include "platform/RKPlatform.h"
 #include "process/RKProcess.h"
 
@@ -126,7 +127,7 @@ void addNamedTargets(const RKMemspreadArgs& args, RKTargetMap& result) {
         } else if (!name) {
             std::fprintf(stderr, "Unable to analyze process with pid %ld (try as root?)\n", static_cast<long>(pid));
         } else {
-            std::fprintf(stderr, "Unable to analyze process %s [%ld] (try as root?)\n", name->c_str(),
+            std::fprintf(stderr, "Unable to analyze process %s [%ld] (try as root?)\n", RKEscapedText(*name).c_str(),
                          static_cast<long>(pid));
         }
     }

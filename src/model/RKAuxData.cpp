@@ -17,7 +17,7 @@ RKAuxJsonValue RKAuxDataMap::jsonRepresentation() const {
     RKAuxJsonValue json;
     json.isObject = true;
     json.members.reserve(entries_.size());
-    for (const auto& [key, node] : entries_) json.members.emplace_back(key, node->jsonRepresentation());
+    for (const auto& [key, node] : entries_) json.members.push_back({key, node->jsonRepresentation()});
     return json;
 }
 

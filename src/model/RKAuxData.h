@@ -13,9 +13,17 @@
 
 // The plain value tree of jsonRepresentation: a number, or members in key order.
 struct RKAuxJsonValue {
+    // A key and its value. Not a std::pair: a pair may not hold the incomplete type it is a
+    // member of, which clang's standard library checks.
+    struct Member;
     bool isObject = false;
     int64_t number = 0;
-    std::vector<std::pair<std::string, RKAuxJsonValue>> members;
+    std::vector<Member> members;
+};
+
+struct RKAuxJsonValue::Member {
+    std::string first;
+    RKAuxJsonValue second;
 };
 
 class RKAuxDataType {

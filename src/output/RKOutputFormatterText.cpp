@@ -203,7 +203,13 @@ void RKOutputFormatterText::printProcessesWithWarnings(const RKProcessList& proc
     auto names = [](const RKProcessList& processes) {
         std::vector<std::string> list;
         for (const auto& process : processes) {
-            if (process) list.push_back(process->name());
+            if (!process) continue;
+            // A process that is not shown (one that could not be read) has no header that would
+            // carry its warnings: they stand in for its name.
+            if (process->hiddenFromDisplay())
+                list.insert(list.end(), process->warnings().begin(), process->warnings().end());
+            else
+                list.push_back(process->name());
         }
         return list;
     };

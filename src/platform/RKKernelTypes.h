@@ -38,6 +38,10 @@ struct RKBsdInfo {
     pid_t pbi_ppid = 0;
     char pbi_comm[MAXCOMLEN + 1] = {};
     char pbi_name[2 * MAXCOMLEN + 1] = {};
+    // When the process started (on Linux: since boot). Two records of one pid with different
+    // start times are two processes.
+    uint64_t pbi_start_tvsec = 0;
+    uint64_t pbi_start_tvusec = 0;
 };
 
 // Share modes of a region record.

@@ -10,6 +10,7 @@
 #include <cerrno>
 #include <chrono>
 
+#include "platform/RKDescriptorBudget.h"
 #include "platform/RKLinuxTask.h"
 
 namespace {
@@ -24,11 +25,12 @@ uint64_t nanoseconds(const timespec& ts) {
 kern_return_t openFailure(int error) {
     if (error == EACCES || error == EPERM) return KERN_PROTECTION_FAILURE;
     if (error == EMFILE || error == ENFILE) return KERN_RESOURCE_SHORTAGE;
-    return KERN_INVALID_ARGUMENT;
+    if (error == ENOENT || error == ESRCH) return KERN_INVALID_ARGUMENT;  // the process is gone
+    return KERN_FAILURE;
 }
 
-// Every measured process holds a descriptor of its /proc directory until the report is done, so
-// measuring all processes of a busy machine needs more than the usual soft limit of 1024.
+// A higher limit lets more processes be gathered at once (RKDescriptorBudget); a low one only
+// makes gathering wait.
 void raiseDescriptorLimit() {
     rlimit limit{};
     if (getrlimit(RLIMIT_NOFILE, &limit) != 0 || limit.rlim_cur >= limit.rlim_max) return;
@@ -46,13 +48,25 @@ RKLinuxPlatform::RKLinuxPlatform(std::string procRoot, std::string sysRoot)
 
 kern_return_t RKLinuxPlatform::taskForPid(pid_t pid, std::unique_ptr<RKTask>& task) {
     std::string path = procRoot_ + "/" + std::to_string(pid);
-    RKUniqueFd directory(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (!directory.valid()) return openFailure(errno);
-    // Opening smaps is the kernel's ptrace-read check: without it nothing can be measured.
-    RKUniqueFd smaps(::openat(directory.get(), "smaps", O_RDONLY | O_CLOEXEC));
-    if (!smaps.valid()) return openFailure(errno);
-    task = std::make_unique<RKLinuxTask>(pid, std::move(directory));
-    return KERN_SUCCESS;
+    RKDescriptorBudget& budget = RKDescriptorBudget::shared();
+    for (;;) {
+        bool overBudget = false;
+        RKDescriptorTicket ticket = budget.acquire(&overBudget);
+        RKUniqueFd directory(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+        // Opening smaps is the kernel's ptrace-read check: without it nothing can be measured.
+        RKUniqueFd smaps;
+        if (directory.valid()) smaps.reset(::openat(directory.get(), "smaps", O_RDONLY | O_CLOEXEC));
+        if (smaps.valid()) {
+            task = std::make_unique<RKLinuxTask>(pid, std::move(directory), std::move(ticket));
+            return KERN_SUCCESS;
+        }
+        const int error = errno;
+        // Out of descriptors while other tasks are open: wait for one of them to close. Not when
+        // the wait already ran out: the holders may be this very thread.
+        const bool outOfDescriptors = error == EMFILE || error == ENFILE;
+        if (outOfDescriptors && !overBudget && budget.shrinkAfterFailure(ticket)) continue;
+        return openFailure(error);
+    }
 }
 
 int RKLinuxPlatform::readSelfRegionMemspread(int32_t& value) {

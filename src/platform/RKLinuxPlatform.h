@@ -20,6 +20,10 @@ public:
     std::optional<std::string> executablePath(pid_t pid) override;
     uint32_t dirtyFlags(pid_t pid) override;
     kern_return_t taskForPid(pid_t pid, std::unique_ptr<RKTask>& task) override;
+    // The same records read through the task's directory descriptor.
+    std::optional<RKBsdInfo> taskBsdInfo(RKTask& task) override;
+    int taskShortBsdInfoStatus(RKTask& task, uint32_t& status) override;
+    std::optional<std::string> taskExecutablePath(RKTask& task) override;
     bool hasSharedRegion() override;
 
     // Address space (RKLinuxRegions.cpp).

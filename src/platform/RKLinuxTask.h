@@ -7,6 +7,7 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/RKDescriptorBudget.h"
 #include "platform/RKLinuxVmaClassifier.h"
 #include "platform/RKPlatform.h"
 #include "platform/RKSmapsParser.h"
@@ -32,7 +33,9 @@ struct RKLinuxWalkSnapshot {
 
 class RKLinuxTask : public RKTask {
 public:
-    RKLinuxTask(pid_t pid, RKUniqueFd directory) : pid_(pid), directory_(std::move(directory)) {}
+    // `ticket`: the slot of the descriptor budget this task holds until it is destroyed.
+    RKLinuxTask(pid_t pid, RKUniqueFd directory, RKDescriptorTicket ticket = {})
+        : pid_(pid), ticket_(std::move(ticket)), directory_(std::move(directory)) {}
 
     pid_t pid() const override { return pid_; }
     int directoryFd() const { return directory_.get(); }
@@ -42,5 +45,6 @@ public:
 
 private:
     pid_t pid_;
+    RKDescriptorTicket ticket_;  // declared first: given back after the directory is closed
     RKUniqueFd directory_;
 };

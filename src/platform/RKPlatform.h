@@ -52,6 +52,14 @@ public:
     virtual uint32_t dirtyFlags(pid_t pid) = 0;
     // task_for_pid: KERN_SUCCESS and the task, or the failure code.
     virtual kern_return_t taskForPid(pid_t pid, std::unique_ptr<RKTask>& task) = 0;
+    // The same three questions asked through an open task, so that they are answered by the
+    // process the task was opened on even when its pid has since been reused. The defaults ask
+    // by pid, for platforms whose tasks cannot outlive their process.
+    virtual std::optional<RKBsdInfo> taskBsdInfo(RKTask& task) { return bsdInfo(task.pid()); }
+    virtual int taskShortBsdInfoStatus(RKTask& task, uint32_t& status) {
+        return shortBsdInfoStatus(task.pid(), status);
+    }
+    virtual std::optional<std::string> taskExecutablePath(RKTask& task) { return executablePath(task.pid()); }
     // Whether live processes map a shared library cache at the architecture's fixed shared
     // region. Linux has none, so its live processes get no shared-region bounds.
     virtual bool hasSharedRegion() = 0;

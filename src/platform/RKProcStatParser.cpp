@@ -53,6 +53,10 @@ std::optional<RKProcStat> RKParseProcStat(std::string_view text) {
     for (int field = 5; field <= 8; field++)
         if (!skipField(text, pos)) return std::nullopt;
     if (!readField(text, pos, stat.flags)) return std::nullopt;
+    // Fields 10 to 21, then the start time.
+    bool complete = true;
+    for (int field = 10; field <= 21 && complete; field++) complete = skipField(text, pos);
+    if (complete && !readField(text, pos, stat.startTime)) stat.startTime = 0;
     return stat;
 }
 

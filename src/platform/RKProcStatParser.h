@@ -19,6 +19,10 @@ struct RKProcStat {
     char state = '?';  // R, S, D, Z, T, t, X, I, ...
     pid_t ppid = 0;
     uint64_t flags = 0;  // field 9
+    // Field 22: clock ticks from boot to the process's start. With the pid it names one process
+    // for the life of the system, so it tells a reused pid from the process first listed. 0 when
+    // the text ends before it.
+    uint64_t startTime = 0;
 };
 
 // Parses /proc/PID/stat. The name may contain anything except a newline, so the fixed fields

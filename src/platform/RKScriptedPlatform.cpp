@@ -66,6 +66,20 @@ std::optional<std::string> RKScriptedPlatform::executablePath(pid_t pid) {
     return std::nullopt;
 }
 
+std::optional<RKBsdInfo> RKScriptedPlatform::taskBsdInfo(RKTask& task) {
+    record("taskBsdInfo", task.pid());
+    auto* process = find(task.pid());
+    if (!process) return std::nullopt;
+    return process->reusedBy ? process->reusedBy : process->info;
+}
+
+std::optional<std::string> RKScriptedPlatform::taskExecutablePath(RKTask& task) {
+    record("taskExecutablePath", task.pid());
+    auto* process = find(task.pid());
+    if (!process) return std::nullopt;
+    return process->reusedBy ? process->reusedByExecutablePath : process->executablePath;
+}
+
 uint32_t RKScriptedPlatform::dirtyFlags(pid_t pid) {
     record("dirtyFlags", pid);
     if (auto* process = find(pid)) return process->dirtyFlags;

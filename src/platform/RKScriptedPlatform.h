@@ -47,6 +47,10 @@ struct RKScriptedProcess {
     uint64_t walkNanoseconds = 0;
     // Added to rusage's phys_memspread at every read: a process whose memory keeps moving.
     uint64_t physMemspreadGrowth = 0;
+    // Set when the pid has been reused since the listing: a task opened on it then reads this
+    // other process's record and executable path.
+    std::optional<RKBsdInfo> reusedBy;
+    std::optional<std::string> reusedByExecutablePath;
 };
 
 class RKScriptedTask : public RKTask {
@@ -99,6 +103,8 @@ public:
     std::optional<std::string> executablePath(pid_t pid) override;
     uint32_t dirtyFlags(pid_t pid) override;
     kern_return_t taskForPid(pid_t pid, std::unique_ptr<RKTask>& task) override;
+    std::optional<RKBsdInfo> taskBsdInfo(RKTask& task) override;
+    std::optional<std::string> taskExecutablePath(RKTask& task) override;
     bool hasSharedRegion() override;
     kern_return_t regionRecurse(RKTask& task, uint64_t& address, uint64_t& size,
                                 RKRegionSubmapInfo& info, uint32_t& count) override;

@@ -13,7 +13,7 @@ bool RKProcess::initWithBsdInfo(const RKBsdInfo& info) {
     pid_ = info.pbi_pid;
     is64bit_ = (info.pbi_flags & PROC_FLAG_LP64) != 0;
     if (!_populateTask()) return false;
-    name_ = _nameForBsdInfo(info);
+    name_ = _gatherName(info);
     displayString_ = name_ + " [" + std::to_string(pid_) + "]";
     pageSize_ = _gatherPageSize();
     return true;
@@ -32,12 +32,19 @@ bool RKProcess::breakDownPhysMemspread() const { return RKAnalysisSettings::brea
 std::string RKProcess::description() const { return "RKProcess[" + std::to_string(pid_) + "]"; }
 
 std::shared_ptr<RKProcess> RKProcess::processWithBsdInfo(const RKBsdInfo& info) {
+    return processWithBsdInfo(info, nullptr);
+}
+
+std::shared_ptr<RKProcess> RKProcess::processWithBsdInfo(const RKBsdInfo& info, kern_return_t* taskResult) {
     std::shared_ptr<RKProcess> process;
     if (info.pbi_flags & PROC_FLAG_SYSTEM)
         process = std::make_shared<RKKernelProcess>();
     else
         process = std::make_shared<RKUserProcess>();
-    if (!process->initWithBsdInfo(info)) return nullptr;
+    if (!process->initWithBsdInfo(info)) {
+        if (taskResult) *taskResult = process->taskResult();
+        return nullptr;
+    }
     return process;
 }
 
@@ -55,7 +62,10 @@ std::string RKProcess::_nameForBsdInfoCommName(const RKBsdInfo& info) {
 }
 
 std::string RKProcess::_nameForBsdInfo(const RKBsdInfo& info) {
-    auto path = RKPlatform::current().executablePath(info.pbi_pid);
+    return _nameForExecutablePath(RKPlatform::current().executablePath(info.pbi_pid), info);
+}
+
+std::string RKProcess::_nameForExecutablePath(const std::optional<std::string>& path, const RKBsdInfo& info) {
     if (path) {
         std::string_view name = RKLastPathComponent(*path);
         if (!name.empty()) return std::string(name);

@@ -45,6 +45,8 @@ public:
     bool isEqual(const RKProcess& other) const { return pid_ == other.pid_; }
 
     virtual bool _populateTask();  // the base has nothing to read: false
+    // Why the task could not be opened (a kern_return_t); KERN_FAILURE when nothing was tried.
+    kern_return_t taskResult() const { return taskResult_; }
     virtual void gatherData() {}
 
     const std::vector<std::string>& globalErrors() const { return globalErrors_; }
@@ -77,11 +79,18 @@ public:
 
     // Factories: the kernel process for the system record, the live user process otherwise.
     static std::shared_ptr<RKProcess> processWithBsdInfo(const RKBsdInfo& info);
+    // The same; on failure `taskResult` receives why the process could not be opened.
+    static std::shared_ptr<RKProcess> processWithBsdInfo(const RKBsdInfo& info, kern_return_t* taskResult);
     static std::shared_ptr<RKProcess> processWithPid(pid_t pid);
     // The name rule: the executable's last path component, else the record's names, else
     // "Unknown".
     static std::string _nameForBsdInfoCommName(const RKBsdInfo& info);
     static std::string _nameForBsdInfo(const RKBsdInfo& info);
+    // The name rule on an executable path already read.
+    static std::string _nameForExecutablePath(const std::optional<std::string>& path, const RKBsdInfo& info);
+    // The name this process gets at initialisation: the name rule, by pid. A live process asks
+    // through its task instead.
+    virtual std::string _gatherName(const RKBsdInfo& info) { return _nameForBsdInfo(info); }
 
     // Target selection over the system's process list.
     static std::optional<RKTargetMap> allProcessesExcludingPids(const std::set<pid_t>& excluded);
@@ -95,6 +104,7 @@ protected:
     // Subclasses append to these directly.
     std::vector<std::string> errors_;
     std::vector<std::string> warnings_;
+    kern_return_t taskResult_ = KERN_FAILURE;
 
 private:
     pid_t pid_ = 0;

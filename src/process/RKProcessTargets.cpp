@@ -7,6 +7,7 @@
 
 #include "platform/RKPlatform.h"
 #include "process/RKProcess.h"
+#include "process/RKUnreadProcess.h"
 
 namespace {
 
@@ -57,7 +58,11 @@ std::optional<RKTargetMap> RKProcess::allProcessesExcludingPids(const std::set<p
     RKTargetMap result;
     for (const RKBsdInfo& info : *list) {
         if (excluded.count(info.pbi_pid)) continue;
-        if (auto process = processWithBsdInfo(info)) result[info.pbi_pid] = std::move(process);
+        kern_return_t taskResult = KERN_FAILURE;
+        if (auto process = processWithBsdInfo(info, &taskResult))
+            result[info.pbi_pid] = std::move(process);
+        else if (auto unread = RKUnreadProcess::processForFailure(info, taskResult))
+            result[info.pbi_pid] = std::move(unread);
     }
     return result;
 }

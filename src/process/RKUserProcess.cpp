@@ -57,6 +57,8 @@ constexpr RKSharedRegionBounds kSharedRegions[] = {
 
 bool RKUserProcess::initWithBsdInfo(const RKBsdInfo& info) {
     setPid(info.pbi_pid);
+    listedStartSeconds_ = info.pbi_start_tvsec;
+    listedStartMicroseconds_ = info.pbi_start_tvusec;
     _gatherIsTranslated();
     if (!RKProcess::initWithBsdInfo(info)) return false;
 
@@ -70,15 +72,7 @@ bool RKUserProcess::initWithBsdInfo(const RKBsdInfo& info) {
     _gatherLedgers();
     _gatherIdleExitStatus();
     sharedRegionAlignmentSize_ = 4096;
-    return true;
-}
-
-bool RKUserProcess::_populateTask() {
-    kern_return_t result = RKPlatform::current().taskForPid(pid(), task_);
-    if (result != KERN_SUCCESS) {
-        mach_error("task_for_pid", result);
-        return false;
-    }
+    _releaseTask();  // opened again when gathering starts
     return true;
 }
 

@@ -61,8 +61,19 @@ public:
     // The record's pid, translation, base initialisation (false without a task), shared-region
     // bounds, an empty image list, then phys memspread, ledgers and idle-exit status.
     bool initWithBsdInfo(const RKBsdInfo& info) override;
-    // task_for_pid; on failure prints the platform's error and the process is not created.
+    // task_for_pid, then a check that the task reaches the process that was listed (its start
+    // time), not a newer one under a reused pid; on failure prints the platform's error and the
+    // process is not created. The task lives only while the process is being read: from here
+    // to the end of initWithBsdInfo, then again from the start to the end of gatherData
+    // (RKUserProcessTask.cpp).
     bool _populateTask() override;
+    // The name rule, with the executable path read through the task.
+    std::string _gatherName(const RKBsdInfo& info) override;
+    // Opens the task again for gathering; false (after a warning for a process that is gone, an
+    // error otherwise) when it cannot be.
+    bool _reopenTaskForGathering();
+    // Closes the task: its descriptors go back for the next process.
+    void _releaseTask() { task_.reset(); }
     bool _isAlive() const override { return true; }
 
     // Images, fresh figures and owned objects (unless hidden), then the walk that fills
@@ -143,8 +154,13 @@ protected:
     uint64_t ledgers_ = 0;
     std::optional<RKImageList> images_;  // exists from construction to the end of the walk
     std::optional<RKOwnedVmObjectMap> ownedVmObjects_;  // from gatherData to the end of the walk
+    // The start time of the listed process, which a task must reach.
+    uint64_t listedStartSeconds_ = 0;
+    uint64_t listedStartMicroseconds_ = 0;
 
 private:
+    // task_for_pid and the start-time check; the task is kept only on success.
+    kern_return_t _openListedTask();
     // The callback of _gatherMemoryData for one walked entry.
     bool _addRegionForEntry(RKRegionWalkState& state, uint64_t start, uint64_t size,
                             const RKRegionSubmapInfo& info, int purgeState,

@@ -5,6 +5,7 @@
 #include <cstring>
 
 #include "model/RKAssert.h"
+#include "model/RKEscapedText.h"
 #include "model/RKMemoryRegion.h"
 #include "process/RKAnalysisSettings.h"
 #include "process/RKUserProcess.h"
@@ -21,7 +22,8 @@ constexpr uint64_t kCarveoutStart = 0x1000000000;
 constexpr uint64_t kCarveoutSize = 0x6000000000;
 
 void printBailingOut(const std::string& displayString) {
-    std::fprintf(stderr, "bailing out for process %s; data may be incomplete!\n", displayString.c_str());
+    std::fprintf(stderr, "bailing out for process %s; data may be incomplete!\n",
+                 RKEscapedText(displayString).c_str());
 }
 
 // strerror_r comes in two flavours; both end up as text here.
@@ -49,6 +51,7 @@ RKRegionSubmapInfo sharedRegionRecord(const RKRegionBasicInfo& basic) {
 
 void RKUserProcess::gatherData() {
     if (memoryRegions()) return;
+    if (!_reopenTaskForGathering()) return;
     if (!hiddenFromDisplay()) {
         _gatherImageData();
         _gatherPhysMemspread();
@@ -56,6 +59,7 @@ void RKUserProcess::gatherData() {
     }
     _gatherMemoryData();
     images_.reset();
+    _releaseTask();
 }
 
 uint64_t RKUserProcess::_lastNonSharedCacheRegion() {
@@ -274,7 +278,9 @@ void RKUserProcess::_processMachVMError(kern_return_t error, kern_return_t expec
     bool zombie = false;
     if (error == expected && _isAlive()) {
         uint32_t status = 0;
-        int result = RKPlatform::current().shortBsdInfoStatus(pid(), status);
+        // Through the task: the pid may already name another process.
+        int result = task_ ? RKPlatform::current().taskShortBsdInfoStatus(*task_, status)
+                           : RKPlatform::current().shortBsdInfoStatus(pid(), status);
         exited = result == ESRCH;
         if (result == 0 && status == SZOMB) {
             zombie = true;
@@ -292,7 +298,7 @@ void RKUserProcess::_addErrnoWarningWithDescription(const std::string& descripti
     char buffer[256] = {};
     const char* text = errnoText(strerror_r(error, buffer, sizeof buffer), buffer);
     std::string message = displayString() + ": " + description + " - " + text;
-    std::fprintf(stderr, "%s\n", message.c_str());
+    std::fprintf(stderr, "%s\n", RKEscapedText(message).c_str());
     warnings_.push_back(std::move(message));
 }
 

@@ -1,0 +1,69 @@
+// A process that all-process selection could not open, through a whole report: named with its
+// pid and reason among the warnings of the text report and of the JSON document, never as a
+// measured process, and escaped.
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <fstream>
+#include <sstream>
+
+#include "analysis/RKMemspread.h"
+#include "output/RKOutputFormatterJSON.h"
+#include "output/RKOutputFormatterText.h"
+#include "platform/RKScriptedPlatform.h"
+#include "process/RKAnalysisSettings.h"
+
+TEST(RKUnreadReport, ProcessThatCouldNotBeOpenedIsAWarningOfTheRun) {
+    auto platform = std::make_shared<RKScriptedPlatform>();
+    RKScopedPlatform scope(platform);
+    RKScriptedRegion region;
+    region.start = 0x10000;
+    region.size = 4 * 4096;
+    region.info.pages_resident = region.info.pages_dirtied = 4;
+    region.info.share_mode = SM_PRIVATE;
+    region.info.object_id_full = 0x4000000000010000ull;
+    platform->addProcess(7, "tool").regions = {region};
+    platform->addProcess(8, "guard\x1b]0;").taskResult = KERN_PROTECTION_FAILURE;
+
+    testing::internal::CaptureStderr();
+    auto targets = RKProcess::allProcessesExcludingPids({});
+    testing::internal::GetCapturedStderr();
+    ASSERT_TRUE(targets);
+    RKProcessList processes;
+    for (const auto& entry : *targets) processes.push_back(entry.second);
+    const std::string textPath = testing::TempDir() + "rkunread-" + std::to_string(getpid()) + ".txt";
+    const std::string jsonPath = textPath + ".json";
+    FILE* file = std::fopen(textPath.c_str(), "w");
+    ASSERT_TRUE(file);
+    {
+        RKMemspread memspread(processes);
+        memspread.gatherData();
+        memspread.analyzeData();
+        memspread.addOutputFormatter(
+            std::make_shared<RKOutputFormatterText>(RKSummaryFormatBytes, 0, "Dirty", file));
+        auto json = RKOutputFormatterJSON::initWithPath(jsonPath);
+        ASSERT_TRUE(json);
+        memspread.addOutputFormatter(json);
+        memspread.printOutputVerbose(false, false);
+        json->close();
+    }
+    std::fclose(file);
+    std::stringstream text, document;
+    text << std::ifstream(textPath).rdbuf();
+    document << std::ifstream(jsonPath).rdbuf();
+    std::remove(textPath.c_str());
+    std::remove(jsonPath.c_str());
+    RKAnalysisSettings::resetCache();
+
+    EXPECT_NE(text.str().find("Warnings were encountered while examining the following processes:\n"
+                              "\tguard\\x1b]0; [8]: not measured - permission denied\n"),
+              std::string::npos)
+        << text.str();
+    EXPECT_NE(text.str().find("tool [7]: 64-bit"), std::string::npos);
+    EXPECT_EQ(text.str().find("guard\\x1b]0; [8]: 64-bit"), std::string::npos) << "not shown as measured";
+    EXPECT_NE(document.str().find(R"("warnings":["guard\u001b]0; [8]: not measured - permission denied"])"),
+              std::string::npos)
+        << document.str();
+    EXPECT_EQ(document.str().find(R"("pid":8)"), std::string::npos) << "no process object of its own";
+}

@@ -1,0 +1,147 @@
+// Measuring all processes of a machine the way a busy server would put it to memspread: under a
+// descriptor limit lower than the number of processes, with other processes' names full of
+// control characters, and while processes come and go hundreds of times a second.
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdlib>
+#include <filesystem>
+#include <set>
+#include <string>
+#include <vector>
+
+#include "support/RKFixtureProcess.h"
+#include "support/RKRunCommand.h"
+#include "support/RKUnprivileged.h"
+
+namespace fs = std::filesystem;
+using namespace std::chrono_literals;
+
+namespace {
+
+// Prints the pid of every process object of the document that carries a memspread figure.
+const char* kMeasuredPids = R"(import json, sys
+document = json.load(open(sys.argv[1], encoding="utf-8"))
+for process in document["processes"]:
+    if "memspread" in process: print(process["pid"])
+)";
+
+fs::path temporaryDocument(const std::string& name) {
+    return fs::temp_directory_path() / ("rk-" + name + "-" + std::to_string(getpid()) + ".json");
+}
+
+// The pids of the measured processes in `document`, or nothing when it does not parse.
+std::optional<std::set<pid_t>> measuredPids(const fs::path& document) {
+    RKCommandResult parsed = RKRunCommand({"python3", "-c", kMeasuredPids, document.string()});
+    if (!parsed.exitedWith(0)) return std::nullopt;
+    std::set<pid_t> pids;
+    for (const std::string& line : RKSplitLines(parsed.standardOutput)) pids.insert(std::stoi(line));
+    return pids;
+}
+
+// Idle children of the test, killed and reaped when it ends.
+class RKIdleChildren {
+public:
+    explicit RKIdleChildren(int count) {
+        for (int i = 0; i < count; i++) {
+            pid_t pid = fork();
+            if (pid == 0) {
+                for (;;) pause();
+            }
+            if (pid > 0) pids.push_back(pid);
+        }
+    }
+    ~RKIdleChildren() {
+        for (pid_t pid : pids) kill(pid, SIGKILL);
+        for (pid_t pid : pids) waitpid(pid, nullptr, 0);
+    }
+    std::vector<pid_t> pids;
+};
+
+// A byte that a terminal could act on, other than the line ends and tabs of the report itself.
+bool hasRawControl(const std::string& text) {
+    for (unsigned char byte : text)
+        if ((byte < 0x20 && byte != '\n' && byte != '\t') || byte == 0x7F) return true;
+    return false;
+}
+
+}  // namespace
+
+TEST(RKAllProcesses, EveryProcessMeasuredUnderADescriptorLimitOf64) {
+    if (geteuid() != 0) GTEST_SKIP() << "-a needs root";
+    RKIdleChildren children(300);
+    ASSERT_EQ(children.pids.size(), 300u);
+    const fs::path document = temporaryDocument("fd64");
+    // Soft and hard limit alike, as `ulimit -n 64` sets them: memspread cannot raise it.
+    RKCommandResult run = RKRunCommand({"prlimit", "--nofile=64:64", MEMSPREAD_BINARY, "-a", "-j", document.string()});
+    auto measured = measuredPids(document);
+    fs::remove(document);
+    ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
+    ASSERT_TRUE(measured) << "the document does not parse";
+    size_t found = 0;
+    for (pid_t pid : children.pids) found += measured->count(pid);
+    EXPECT_EQ(found, 300u) << run.standardError;
+    EXPECT_EQ(run.standardError.find("too many open files"), std::string::npos) << run.standardError;
+}
+
+TEST(RKAllProcesses, OtherProcessesNamesNeverReachATerminalRaw) {
+    if (geteuid() != 0) GTEST_SKIP() << "needs a process another user cannot read";
+    // An executable whose name clears the screen and rings the bell.
+    const std::string name = "rk\x1b[2J\x07name";
+    const fs::path directory = fs::temp_directory_path() / ("rk-names-" + std::to_string(getpid()));
+    fs::create_directories(directory);
+    fs::copy_file(MEMSPREAD_FIXTURE, directory / name);
+    RKFixtureProcess fixture;
+    ASSERT_TRUE(fixture.start((directory / name).string(), {directory.string()})) << fixture.error();
+    const pid_t pid = fixture.pid();
+
+    // As root, every process: the report names it.
+    RKCommandResult all = RKRunCommand({MEMSPREAD_BINARY, "-a"});
+    // As nobody, the root-owned process by name: the refusal names it on standard error.
+    RKCommandResult refused = RKRunCommand(RKCommandAsNobody({name}));
+    fixture.stop();
+    fs::remove_all(directory);
+
+    ASSERT_TRUE(all.exitedWith(0)) << all.standardError;
+    EXPECT_NE(all.standardOutput.find("rk\\x1b[2J\\x07name [" + std::to_string(pid) + "]"), std::string::npos);
+    EXPECT_FALSE(hasRawControl(all.standardOutput));
+    EXPECT_FALSE(hasRawControl(all.standardError)) << all.standardError;
+    EXPECT_NE(refused.standardError.find("Unable to analyze process rk\\x1b[2J\\x07name"), std::string::npos)
+        << refused.standardError;
+    EXPECT_FALSE(hasRawControl(refused.standardError));
+}
+
+// Runs -a for MEMSPREAD_CHURN_SECONDS (default 40) while the churn helper forks, execs and reaps a
+// few hundred processes a second. Every run must end by itself (each is bounded) with exit 0, a
+// complete report and a document that parses and holds the churning parent.
+TEST(RKAllProcesses, CompleteReportWhileProcessesComeAndGo) {
+    if (geteuid() != 0) GTEST_SKIP() << "-a needs root";
+    const char* setting = std::getenv("MEMSPREAD_CHURN_SECONDS");
+    const auto duration = std::chrono::seconds(setting ? std::atoi(setting) : 40);
+    RKFixtureProcess churn;
+    ASSERT_TRUE(churn.start(MEMSPREAD_CHURN)) << churn.error();
+    const fs::path document = temporaryDocument("churn");
+    const auto end = std::chrono::steady_clock::now() + duration;
+    int runs = 0;
+    while (std::chrono::steady_clock::now() < end) {
+        // A run takes a second or two; the bound is for a loaded machine and only stops a hang.
+        RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, "-a", "-j", document.string()}, 120s);
+        runs++;
+        ASSERT_TRUE(run.started) << "run " << runs << " could not be started";
+        ASSERT_TRUE(run.exitedWith(0)) << "run " << runs << " did not exit 0 within two minutes ("
+                                       << (run.exitStatus ? "status " + std::to_string(*run.exitStatus)
+                                                          : std::string("killed or timed out"))
+                                       << "):\n" << run.standardError;
+        ASSERT_NE(run.standardOutput.find("Summary Memspread:"), std::string::npos) << "run " << runs;
+        auto measured = measuredPids(document);
+        ASSERT_TRUE(measured) << "run " << runs << ": the document does not parse";
+        EXPECT_EQ(measured->count(churn.pid()), 1u) << "run " << runs << ": the churning parent is missing";
+    }
+    churn.stop();
+    fs::remove(document);
+    std::printf("%d runs of -a in %llds of churn\n", runs, static_cast<long long>(duration.count()));
+    EXPECT_GE(runs, 1);
+}

@@ -1,0 +1,121 @@
+// A live process's task on scripted kernel answers: it is open only while the process is read,
+// a pid reused between listing and reading never lends the new process's name or memory to the
+// listed one, and a process that all-process selection could not open is named in the report
+// with its reason, unless it is simply gone.
+#include <gtest/gtest.h>
+
+#include <cstring>
+
+#include "driver/RKMemspreadArgs.h"
+#include "platform/RKScriptedPlatform.h"
+#include "process/RKAnalysisSettings.h"
+#include "process/RKUnreadProcess.h"
+#include "process/RKUserProcess.h"
+
+namespace {
+
+constexpr uint64_t P = 4096;
+
+RKScriptedRegion region(uint64_t start, uint64_t pages, uint32_t dirtied) {
+    RKScriptedRegion entry;
+    entry.start = start;
+    entry.size = pages * P;
+    entry.info.pages_resident = dirtied;
+    entry.info.pages_dirtied = dirtied;
+    entry.info.share_mode = SM_PRIVATE;
+    entry.info.object_id_full = 0x4000000000000000ull | start;
+    return entry;
+}
+
+class RKTaskLifecycleTest : public ::testing::Test {
+protected:
+    RKTaskLifecycleTest() {
+        platform->addProcess(0, "kernel", 0, PROC_FLAG_SYSTEM);
+        RKScriptedProcess& listed = platform->addProcess(40, "listed");
+        listed.info.pbi_start_tvsec = 1000;
+        listed.executablePath = "/usr/bin/listed";
+        listed.regions = {region(0x10000, 4, 4)};
+    }
+    void TearDown() override { RKAnalysisSettings::resetCache(); }
+
+    RKScriptedProcess& listed() { return *platform->find(40); }
+    // The pid 40 now names a process that started later, with memory of its own.
+    void reuse() {
+        RKBsdInfo intruder = listed().info;
+        std::strncpy(intruder.pbi_comm, "intruder", MAXCOMLEN);
+        intruder.pbi_start_tvsec = 2000;
+        listed().reusedBy = intruder;
+        listed().reusedByExecutablePath = "/usr/bin/intruder";
+    }
+    // Every process of the system, as -a selects them, with what selecting printed.
+    RKTargetMap all() {
+        testing::internal::CaptureStderr();
+        auto map = RKProcess::allProcessesExcludingPids({});
+        printed = testing::internal::GetCapturedStderr();
+        return map.value_or(RKTargetMap{});
+    }
+
+    std::shared_ptr<RKScriptedPlatform> platform = std::make_shared<RKScriptedPlatform>();
+    RKScopedPlatform scope{platform};
+    std::string printed;
+};
+
+}  // namespace
+
+TEST_F(RKTaskLifecycleTest, TaskIsOpenOnlyWhileTheProcessIsRead) {
+    auto process = std::dynamic_pointer_cast<RKUserProcess>(RKProcess::processWithPid(40));
+    ASSERT_TRUE(process);
+    EXPECT_EQ(process->name(), "listed") << "named through the task";
+    EXPECT_EQ(process->task(), nullptr) << "closed once initialised";
+    EXPECT_EQ(platform->callCount("taskForPid"), 1u);
+    process->gatherData();
+    EXPECT_EQ(process->task(), nullptr) << "closed once gathered";
+    EXPECT_EQ(platform->callCount("taskForPid"), 2u) << "opened again for gathering";
+    ASSERT_TRUE(process->memoryRegions());
+    EXPECT_EQ(process->memoryRegions()->size(), 1u);
+}
+
+TEST_F(RKTaskLifecycleTest, ReusedPidNeverReadAsTheListedProcess) {
+    // Reused between listing and opening: the listed process is gone, nothing is made of it.
+    reuse();
+    RKTargetMap targets = all();
+    EXPECT_EQ(targets.count(40), 0u);
+    EXPECT_EQ(platform->callCount("taskExecutablePath"), 0u) << "the intruder's name is never read";
+    EXPECT_NE(printed.find("task_for_pid: process is gone"), std::string::npos) << printed;
+
+    // Reused between opening and gathering: a warning of the listed process, and no memory.
+    listed().reusedBy.reset();
+    auto process = RKProcess::processWithPid(40);
+    ASSERT_TRUE(process);
+    reuse();
+    testing::internal::CaptureStderr();
+    process->gatherData();
+    testing::internal::GetCapturedStderr();
+    EXPECT_EQ(process->name(), "listed");
+    EXPECT_FALSE(process->memoryRegions()) << "the intruder's regions are not the listed process's";
+    EXPECT_EQ(platform->callCount("regionRecurse"), 0u);
+    EXPECT_EQ(process->warnings(), std::vector<std::string>{"listed [40]: process is gone (process exited)"});
+    EXPECT_TRUE(process->errors().empty());
+}
+
+TEST_F(RKTaskLifecycleTest, ProcessThatCouldNotBeOpenedIsNamedUnlessGone) {
+    platform->addProcess(41, "guarded\x1b[2J").taskResult = KERN_PROTECTION_FAILURE;
+    platform->addProcess(42, "starved").taskResult = KERN_RESOURCE_SHORTAGE;
+    platform->addProcess(43, "exited").taskResult = KERN_INVALID_ARGUMENT;
+    RKTargetMap targets = all();
+    EXPECT_EQ(printed, "task_for_pid: permission denied\ntask_for_pid: too many open files\n"
+                       "task_for_pid: process is gone\n");
+    ASSERT_EQ(targets.count(41), 1u);
+    ASSERT_EQ(targets.count(42), 1u);
+    EXPECT_EQ(targets.count(43), 0u) << "a process that is gone is no longer part of the system";
+    for (pid_t pid : {41, 42}) {
+        RKProcess& unread = *targets[pid];
+        EXPECT_TRUE(dynamic_cast<const RKUnreadProcess*>(&unread));
+        EXPECT_TRUE(unread.hiddenFromDisplay()) << "never shown as a measured process";
+        unread.gatherData();
+        EXPECT_FALSE(unread.memoryRegions());
+    }
+    EXPECT_EQ(targets[41]->warnings(),
+              std::vector<std::string>{"guarded\x1b[2J [41]: not measured - permission denied"});
+    EXPECT_EQ(targets[42]->warnings(), std::vector<std::string>{"starved [42]: not measured - too many open files"});
+}
