@@ -135,6 +135,19 @@ struct RKOwnedVmObjectRecord {
     uint32_t flags = 0;  // bit 0 vo_no_memspread, bits 1-3 vo_ledger_tag, bits 4-5 purgable
 };
 
+// One segment of one loaded image, as the platform's image lister reports it (the symbol
+// library's owners and segments elsewhere; on Linux the mappings of executable files).
+struct RKImageSegmentRecord {
+    std::string path;       // of the image file
+    uint64_t baseAddress = 0;  // the image's load address
+    uint64_t start = 0;
+    uint64_t size = 0;
+    std::string name;       // the segment's name
+    // The segment code (2 text, 3 data, 4 link-edit) when the platform knows it; 0 when the
+    // name decides.
+    uint8_t segment = 0;
+};
+
 // mach_get_times.
 struct RKClockReadings {
     uint64_t absolute = 0;    // ticks of the uptime clock

@@ -29,6 +29,7 @@ public:
                          RKRegionBasicInfo& info) override;
     kern_return_t purgableState(RKTask& task, uint64_t address, int& state) override;
     std::optional<std::string> regionFileName(RKTask& task, uint64_t address) override;
+    kern_return_t imageSegments(RKTask& task, std::vector<RKImageSegmentRecord>& segments) override;
     kern_return_t pageRangeQuery(RKTask& task, uint64_t address, uint64_t size,
                                  uint32_t* dispositions, uint64_t& count) override;
 

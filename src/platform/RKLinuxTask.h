@@ -28,6 +28,9 @@ struct RKLinuxWalkSnapshot {
     // What follows the last region: KERN_INVALID_ADDRESS, or MACH_SEND_INVALID_DEST when the
     // process went away while it was read (the regions may then be only a prefix).
     kern_return_t end = KERN_INVALID_ADDRESS;
+    // Read for the image lister just before a walk: the walk that starts next uses it instead
+    // of reading smaps again.
+    bool readyForWalk = false;
 };
 
 class RKLinuxTask : public RKTask {

@@ -66,6 +66,9 @@ public:
     virtual kern_return_t purgableState(RKTask& task, uint64_t address, int& state) = 0;
     // proc_regionfilename: the path of the file mapped at `address`, nothing when none.
     virtual std::optional<std::string> regionFileName(RKTask& task, uint64_t address) = 0;
+    // The segments of the task's loaded images, in no particular order: KERN_SUCCESS, or the
+    // failure code of reading the address space.
+    virtual kern_return_t imageSegments(RKTask& task, std::vector<RKImageSegmentRecord>& segments) = 0;
     // mach_vm_page_range_query: one disposition word per page of [address, address + size).
     // `count` is in: room in `dispositions`, out: the number written.
     virtual kern_return_t pageRangeQuery(RKTask& task, uint64_t address, uint64_t size,

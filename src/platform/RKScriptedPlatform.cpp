@@ -135,6 +135,15 @@ std::optional<std::string> RKScriptedPlatform::regionFileName(RKTask& task, uint
     return region->path;
 }
 
+kern_return_t RKScriptedPlatform::imageSegments(RKTask& task, std::vector<RKImageSegmentRecord>& segments) {
+    record("imageSegments", task.pid());
+    auto* process = find(task.pid());
+    if (!process) return MACH_SEND_INVALID_DEST;
+    if (process->imagesResult != KERN_SUCCESS) return process->imagesResult;
+    segments = process->images;
+    return KERN_SUCCESS;
+}
+
 kern_return_t RKScriptedPlatform::pageRangeQuery(RKTask& task, uint64_t address, uint64_t size,
                                                  uint32_t* dispositions, uint64_t& count) {
     record("pageRangeQuery", task.pid());

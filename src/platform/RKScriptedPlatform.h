@@ -33,6 +33,9 @@ struct RKScriptedProcess {
     // the normal end; anything else is a failed walk).
     std::vector<RKScriptedRegion> regions;
     kern_return_t walkEnd = KERN_INVALID_ADDRESS;
+    // What the image lister answers.
+    std::vector<RKImageSegmentRecord> images;
+    kern_return_t imagesResult = KERN_SUCCESS;
     // Page dispositions by page address; pages not listed answer 0. pageQueryResult != 0 fails.
     std::map<uint64_t, uint32_t> dispositions;
     kern_return_t pageQueryResult = KERN_SUCCESS;
@@ -94,6 +97,7 @@ public:
                          RKRegionBasicInfo& info) override;
     kern_return_t purgableState(RKTask& task, uint64_t address, int& state) override;
     std::optional<std::string> regionFileName(RKTask& task, uint64_t address) override;
+    kern_return_t imageSegments(RKTask& task, std::vector<RKImageSegmentRecord>& segments) override;
     kern_return_t pageRangeQuery(RKTask& task, uint64_t address, uint64_t size,
                                  uint32_t* dispositions, uint64_t& count) override;
     int pidRusage(RKTask& task, RKRusageInfo& info) override;

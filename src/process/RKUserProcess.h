@@ -15,6 +15,7 @@
 #include "process/RKProcess.h"
 
 class RKImage;
+class RKImageEnumerator;
 class RKMemoryRegion;
 
 // One entry of the address-space walk: start, size, the region record, the purge state
@@ -38,6 +39,8 @@ struct RKRegionWalkState {
     bool hidden = false;
     bool breakDown = false;
     bool sharingAnalysisDisabled = false;
+    // Over the process's images, in ascending address order for the whole walk.
+    std::shared_ptr<RKImageEnumerator> imageEnumerator;
 };
 
 // Architectures that decide where the shared library cache is mapped.
@@ -94,10 +97,10 @@ public:
     virtual bool _populateMemoryRegionWithPageQueries(RKMemoryRegion& region, const RKRegionSubmapInfo& info);
     // Splits a mixed region into per-page-state runs. Not yet: no subranges.
     virtual void _addSubrangesForRegion(RKMemoryRegion& region, int purgeState);
-    // Reads the loaded images. Not yet: none, so no region is named after an image.
-    virtual void _gatherImageData() {}
-    // Names a region after the image segment it lies in. Not yet: false.
-    virtual bool _nameRegionFromImages(RKMemoryRegion& region, RKRegionWalkState& state);
+    // Reads the loaded images into `images`, sorted by start (RKUserProcessImages.cpp).
+    virtual void _gatherImageData();
+    // Names a region after the image segment it lies in; false when it lies in none.
+    bool _nameRegionFromImages(RKMemoryRegion& region, RKRegionWalkState& state);
     // The VM objects the task owns. Not yet: no list.
     virtual std::optional<RKOwnedVmObjectMap> _gatherOwnedVmObjects() { return std::nullopt; }
     // Cuts an entry of the shared region at image boundaries into `state.regions`; false when a

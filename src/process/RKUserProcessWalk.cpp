@@ -7,6 +7,7 @@
 #include "model/RKAssert.h"
 #include "model/RKMemoryRegion.h"
 #include "process/RKAnalysisSettings.h"
+#include "process/RKImage.h"
 #include "process/RKUserProcess.h"
 
 namespace {
@@ -159,6 +160,7 @@ void RKUserProcess::_gatherMemoryData() {
     state.hidden = hiddenFromDisplay();
     state.breakDown = breakDownPhysMemspread();
     state.sharingAnalysisDisabled = RKAnalysisSettings::isSharingAnalysisDisabled();
+    if (images_) state.imageEnumerator = std::make_shared<RKImageEnumerator>(*images_);
     enumerateRegions([&](uint64_t start, uint64_t size, const RKRegionSubmapInfo& info, int purgeState,
                          const std::optional<std::string>& path, const std::optional<std::string>& name,
                          bool verbose) {
@@ -328,8 +330,6 @@ void RKUserProcess::_addErrnoWarningWithDescription(const std::string& descripti
 bool RKUserProcess::_populateMemoryRegionWithPageQueries(RKMemoryRegion&, const RKRegionSubmapInfo&) { return true; }
 
 void RKUserProcess::_addSubrangesForRegion(RKMemoryRegion&, int) {}
-
-bool RKUserProcess::_nameRegionFromImages(RKMemoryRegion&, RKRegionWalkState&) { return false; }
 
 bool RKUserProcess::_addRegionsToArray(RKRegionWalkState&, uint64_t, uint64_t, const RKRegionSubmapInfo&) {
     return true;
