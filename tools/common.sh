@@ -1,6 +1,6 @@
 # Shared by run.sh and test.sh: install what the build needs, then configure and build.
 
-memspread_packages=(cmake g++ make libbsd-dev libgtest-dev libgmock-dev libbenchmark-dev util-linux python3)
+memspread_packages=(cmake g++ make libbsd-dev libgtest-dev libgmock-dev libbenchmark-dev util-linux python3 nlohmann-json3-dev libzstd-dev)
 
 # Installs the packages that are missing. apt-get runs only when something is missing, so a
 # prepared machine builds without network or root.

@@ -110,6 +110,9 @@ public:
     // Charges a tag-named region from the owned-object list. Not yet: nothing changes.
     virtual void _chargeOwnedObjectForRegion(RKMemoryRegion& region, const RKRegionSubmapInfo& info,
                                              int purgeState, RKRegionWalkState& state);
+    // Completes a region after it was sized and named, for sources that saved more than the
+    // region record (a Linux snapshot). The live walk has nothing to add.
+    virtual void _completeRegion(RKMemoryRegion&) {}
     // Appends a region for every owned object the walk did not meet. Not yet: none.
     virtual void _addUnconsumedOwnedObjectRegions(RKRegionWalkState& state);
 

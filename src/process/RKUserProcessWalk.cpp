@@ -203,6 +203,7 @@ bool RKUserProcess::_addRegionForEntry(RKRegionWalkState& state, uint64_t start,
     region->segment = RKSegmentNoImage;
     region->verbose = verbose;
     _nameRegion(*region, info, purgeState, path, name, state);
+    _completeRegion(*region);
 
     if (state.breakDown && !state.sharingAnalysisDisabled && !state.hidden &&
         region->eligibleForSubrangesUsingPageSize(pageSize()))
