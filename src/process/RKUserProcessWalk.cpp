@@ -164,6 +164,7 @@ void RKUserProcess::_gatherMemoryData() {
                          bool verbose) {
         return _addRegionForEntry(state, start, size, info, purgeState, path, name, verbose);
     });
+    _addPendingSubranges(state);
     _addUnconsumedOwnedObjectRegions(state);
     ownedVmObjects_.reset();
     _reconcileUnmappedOwnedRegion(state);
@@ -202,9 +203,7 @@ bool RKUserProcess::_addRegionForEntry(RKRegionWalkState& state, uint64_t start,
     region->verbose = verbose;
     _nameRegion(*region, info, purgeState, path, name, state);
 
-    if (state.breakDown && !state.sharingAnalysisDisabled && !state.hidden &&
-        region->eligibleForSubrangesUsingPageSize(pageSize()))
-        _addSubrangesForRegion(*region, purgeState);
+    _addSubrangesIfEligible(region, info, purgeState, state);
     if (region != state.unmappedOwnedRegion) state.regions.push_back(std::move(region));
     return false;
 }
@@ -324,10 +323,6 @@ void RKUserProcess::_addErrnoWarningWithDescription(const std::string& descripti
 }
 
 // ---- Steps that later sources of the process's memory fill in ----
-
-bool RKUserProcess::_populateMemoryRegionWithPageQueries(RKMemoryRegion&, const RKRegionSubmapInfo&) { return true; }
-
-void RKUserProcess::_addSubrangesForRegion(RKMemoryRegion&, int) {}
 
 bool RKUserProcess::_nameRegionFromImages(RKMemoryRegion&, RKRegionWalkState&) { return false; }
 
