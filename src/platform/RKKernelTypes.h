@@ -160,3 +160,21 @@ struct RKTimebase {
     uint32_t numer = 1;
     uint32_t denom = 1;
 };
+
+// One range whose page dispositions will be asked for, with what the region walk knows of it:
+// whether its pages are a file's (a clean file page is not memory), and how many of its pages
+// at most were lazily freed (the kernel keeps that count per mapping only).
+struct RKPageQueryRange {
+    uint64_t start = 0;
+    uint64_t size = 0;
+    bool fileBacked = false;
+    uint64_t reusablePages = 0;
+};
+
+// What this system's page queries see.
+struct RKPageQueryAbilities {
+    // Dirty file pages are told from clean ones (on Linux: /proc/kpageflags is readable).
+    bool dirtyFilePages = true;
+    // Physical frame numbers are visible, so pages can be identified across processes.
+    bool frames = false;
+};

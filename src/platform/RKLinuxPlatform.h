@@ -22,7 +22,7 @@ public:
     kern_return_t taskForPid(pid_t pid, std::unique_ptr<RKTask>& task) override;
     bool hasSharedRegion() override;
 
-    // Address space (RKLinuxRegions.cpp).
+    // Address space (RKLinuxRegions.cpp; page queries RKLinuxPages.cpp).
     kern_return_t regionRecurse(RKTask& task, uint64_t& address, uint64_t& size,
                                 RKRegionSubmapInfo& info, uint32_t& count) override;
     kern_return_t region(RKTask& task, uint64_t& address, uint64_t& size,
@@ -32,6 +32,9 @@ public:
     kern_return_t imageSegments(RKTask& task, std::vector<RKImageSegmentRecord>& segments) override;
     kern_return_t pageRangeQuery(RKTask& task, uint64_t address, uint64_t size,
                                  uint32_t* dispositions, uint64_t& count) override;
+    // Page queries (RKLinuxPages.cpp).
+    void preparePageRangeQueries(RKTask& task, const std::vector<RKPageQueryRange>& ranges) override;
+    RKPageQueryAbilities pageQueryAbilities() override;
 
     // Per-process figures (RKLinuxFigures.cpp).
     int pidRusage(RKTask& task, RKRusageInfo& info) override;

@@ -84,8 +84,3 @@ std::optional<std::string> RKLinuxPlatform::regionFileName(RKTask& task, uint64_
     if (!region || region->detail.empty()) return std::nullopt;
     return std::string(region->detail);
 }
-
-kern_return_t RKLinuxPlatform::pageRangeQuery(RKTask&, uint64_t, uint64_t, uint32_t*, uint64_t& count) {
-    count = 0;
-    return KERN_FAILURE;
-}

@@ -7,6 +7,7 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/RKLinuxPageReader.h"
 #include "platform/RKLinuxVmaClassifier.h"
 #include "platform/RKPlatform.h"
 #include "platform/RKSmapsParser.h"
@@ -42,6 +43,8 @@ public:
 
     // Set while a walk is under way (RKLinuxRegions.cpp); dropped when it reaches the end.
     std::unique_ptr<RKLinuxWalkSnapshot> snapshot;
+    // Page data read ahead for the page queries that follow (RKLinuxPages.cpp).
+    std::unique_ptr<RKLinuxPageData> pageData;
 
 private:
     pid_t pid_;

@@ -159,6 +159,14 @@ kern_return_t RKScriptedPlatform::pageRangeQuery(RKTask& task, uint64_t address,
     return KERN_SUCCESS;
 }
 
+void RKScriptedPlatform::preparePageRangeQueries(RKTask& task, const std::vector<RKPageQueryRange>& ranges) {
+    record("preparePageRangeQueries", task.pid());
+    std::lock_guard lock(mutex_);
+    if (auto* process = find(task.pid())) process->preparedRanges.push_back(ranges);
+}
+
+RKPageQueryAbilities RKScriptedPlatform::pageQueryAbilities() { return pageAbilities; }
+
 int RKScriptedPlatform::pidRusage(RKTask& task, RKRusageInfo& info) {
     record("pidRusage", task.pid());
     auto* process = find(task.pid());

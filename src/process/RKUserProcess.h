@@ -29,6 +29,18 @@ using RKRegionCallback =
 // Owned VM objects by object id; absent when there is no list at all.
 using RKOwnedVmObjectMap = std::map<uint64_t, RKOwnedVmObjectRecord>;
 
+// A region to split into subranges after the walk, with what its page query needs.
+struct RKSubrangeCandidate {
+    std::shared_ptr<RKMemoryRegion> region;
+    int purgeState = VM_PURGABLE_DENY;
+    RKPageQueryRange range;
+};
+
+// Receives one chunk of page dispositions: the dispositions, how many, the chunk's index and
+// the number of chunks.
+using RKDispositionChunkBlock =
+    std::function<void(const uint32_t* dispositions, uint64_t count, uint64_t chunk, uint64_t chunks)>;
+
 // What one region-building pass carries from region to region and into the steps after it.
 struct RKRegionWalkState {
     RKRegionList regions;
@@ -41,6 +53,9 @@ struct RKRegionWalkState {
     bool sharingAnalysisDisabled = false;
     // Over the process's images, in ascending address order for the whole walk.
     std::shared_ptr<RKImageEnumerator> imageEnumerator;
+    // Regions waiting for their subranges until the walk is over, so that the process's page
+    // data is read once, for these regions only (RKUserProcessPages.cpp).
+    std::vector<RKSubrangeCandidate> subrangeCandidates;
 };
 
 // Architectures that decide where the shared library cache is mapped.
@@ -92,15 +107,31 @@ public:
     virtual void _gatherIdleExitStatus();
     void _setIdleExitStatusFromDirtyFlags(uint32_t flags);
 
-    // ---- Steps filled in by later sources of the process's memory ----
-    // Sizes a region from page dispositions instead of the region counters. Not yet: true.
+    // ---- Page dispositions (RKUserProcessPages.cpp) ----
+    // Asks for the dispositions of `pagesToQuery` pages from the page-aligned `startAddr`, at
+    // most 4096 pages a call, handing each chunk to `block`. False, after an error or (for a
+    // process that exited) a warning, when a query failed.
+    virtual bool _enumerateDispositionChunks(uint64_t startAddr, uint64_t pagesToQuery,
+                                             const RKDispositionChunkBlock& block);
+    // Sizes a region (dirty and swapped, which must be 0) from page dispositions instead of the
+    // region counters. A page shared with the previous region is taken from the disposition
+    // cache, and an unused shared-cache region is charged its part of the page it shares with
+    // the next. False when a query failed; what was counted stays.
     virtual bool _populateMemoryRegionWithPageQueries(RKMemoryRegion& region, const RKRegionSubmapInfo& info);
-    // Splits a mixed region into per-page-state runs. Not yet: no subranges.
+    // Splits a region into runs of pages of one state, in object-offset space.
     virtual void _addSubrangesForRegion(RKMemoryRegion& region, int purgeState);
+    // Rule 7 of the region callback: notes an eligible region for its subranges.
+    void _addSubrangesIfEligible(const std::shared_ptr<RKMemoryRegion>& region, const RKRegionSubmapInfo& info,
+                                 int purgeState, RKRegionWalkState& state);
+    // After the walk: reads the noted regions' page data at once and builds their subranges.
+    void _addPendingSubranges(RKRegionWalkState& state);
+
     // Reads the loaded images into `images`, sorted by start (RKUserProcessImages.cpp).
     virtual void _gatherImageData();
     // Names a region after the image segment it lies in; false when it lies in none.
     bool _nameRegionFromImages(RKMemoryRegion& region, RKRegionWalkState& state);
+
+    // ---- Steps filled in by later sources of the process's memory ----
     // The VM objects the task owns. Not yet: no list.
     virtual std::optional<RKOwnedVmObjectMap> _gatherOwnedVmObjects() { return std::nullopt; }
     // Cuts an entry of the shared region at image boundaries into `state.regions`; false when a
@@ -141,6 +172,14 @@ protected:
     uint64_t ledgers_ = 0;
     std::optional<RKImageList> images_;  // exists from construction to the end of the walk
     std::optional<RKOwnedVmObjectMap> ownedVmObjects_;  // from gatherData to the end of the walk
+    // The disposition of the last page of the latest region sized from dispositions whose end
+    // is not page-aligned, and that page's address (0: none).
+    uint64_t cachedDispositionAddress_ = 0;
+    uint32_t cachedDisposition_ = 0;
+    // An unused shared-cache region waiting for the disposition of its last, partial page.
+    // Not owned: the region lives in the walk's region list until the walk is over.
+    RKMemoryRegion* pendingUnusedSharedRegion_ = nullptr;
+    bool pageQueryFailed_ = false;  // a page query failed: the process is gone or unreadable
 
 private:
     // The callback of _gatherMemoryData for one walked entry.

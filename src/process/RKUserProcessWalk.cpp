@@ -166,6 +166,7 @@ void RKUserProcess::_gatherMemoryData() {
                          bool verbose) {
         return _addRegionForEntry(state, start, size, info, purgeState, path, name, verbose);
     });
+    _addPendingSubranges(state);
     _addUnconsumedOwnedObjectRegions(state);
     ownedVmObjects_.reset();
     _reconcileUnmappedOwnedRegion(state);
@@ -205,9 +206,7 @@ bool RKUserProcess::_addRegionForEntry(RKRegionWalkState& state, uint64_t start,
     _nameRegion(*region, info, purgeState, path, name, state);
     _completeRegion(*region);
 
-    if (state.breakDown && !state.sharingAnalysisDisabled && !state.hidden &&
-        region->eligibleForSubrangesUsingPageSize(pageSize()))
-        _addSubrangesForRegion(*region, purgeState);
+    _addSubrangesIfEligible(region, info, purgeState, state);
     if (region != state.unmappedOwnedRegion) state.regions.push_back(std::move(region));
     return false;
 }
@@ -327,10 +326,6 @@ void RKUserProcess::_addErrnoWarningWithDescription(const std::string& descripti
 }
 
 // ---- Steps that later sources of the process's memory fill in ----
-
-bool RKUserProcess::_populateMemoryRegionWithPageQueries(RKMemoryRegion&, const RKRegionSubmapInfo&) { return true; }
-
-void RKUserProcess::_addSubrangesForRegion(RKMemoryRegion&, int) {}
 
 bool RKUserProcess::_addRegionsToArray(RKRegionWalkState&, uint64_t, uint64_t, const RKRegionSubmapInfo&) {
     return true;
