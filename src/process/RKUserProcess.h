@@ -130,14 +130,14 @@ public:
     virtual void _gatherImageData();
     // Names a region after the image segment it lies in; false when it lies in none.
     bool _nameRegionFromImages(RKMemoryRegion& region, RKRegionWalkState& state);
+    // Cuts an entry of the shared region into one region per image segment and one per gap
+    // between segments, into `state.regions` (RKUserProcessSharedRegion.cpp). False when a page
+    // query failed.
+    bool _addRegionsToArray(RKRegionWalkState& state, uint64_t start, uint64_t size, const RKRegionSubmapInfo& info);
 
     // ---- Steps filled in by later sources of the process's memory ----
     // The VM objects the task owns. Not yet: no list.
     virtual std::optional<RKOwnedVmObjectMap> _gatherOwnedVmObjects() { return std::nullopt; }
-    // Cuts an entry of the shared region at image boundaries into `state.regions`; false when a
-    // page query failed. Not yet: the entry is skipped (no shared region on this platform).
-    virtual bool _addRegionsToArray(RKRegionWalkState& state, uint64_t start, uint64_t size,
-                                    const RKRegionSubmapInfo& info);
     // Charges a tag-named region from the owned-object list. Not yet: nothing changes.
     virtual void _chargeOwnedObjectForRegion(RKMemoryRegion& region, const RKRegionSubmapInfo& info,
                                              int purgeState, RKRegionWalkState& state);

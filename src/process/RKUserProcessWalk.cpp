@@ -131,6 +131,21 @@ bool RKUserProcess::_walkStep(uint64_t& address, uint64_t last, bool& pseudoRegi
             if (count <= kRecordCountBeforeFullObjectId) info.object_id_full = info.object_id;
             // Nothing after the owned-memory pseudo-region belongs to the address space.
             if (info.user_tag != RK_OWNED_MEMORY_TAG && pseudoRegionSeen) return false;
+            // The bisection missed what lies below the shared region, so the recursion reached
+            // into it: that entry's record must come from the top level all the same.
+            if (start >= sharedRegionBase_ && start < sharedEnd) {
+                RKRegionBasicInfo basic;
+                const uint64_t entry = start;
+                result = platform.region(*task_, start, size, basic);
+                if (result == KERN_SUCCESS && start <= entry) {
+                    size -= std::min(size, entry - start);
+                    start = entry;
+                    info = sharedRegionRecord(basic);
+                    inSharedRegion = true;
+                } else if (result != KERN_SUCCESS) {
+                    failedCall = "mach_vm_region";
+                }
+            }
         } else {
             failedCall = "mach_vm_region_recurse";
         }
@@ -326,10 +341,6 @@ void RKUserProcess::_addErrnoWarningWithDescription(const std::string& descripti
 }
 
 // ---- Steps that later sources of the process's memory fill in ----
-
-bool RKUserProcess::_addRegionsToArray(RKRegionWalkState&, uint64_t, uint64_t, const RKRegionSubmapInfo&) {
-    return true;
-}
 
 void RKUserProcess::_chargeOwnedObjectForRegion(RKMemoryRegion&, const RKRegionSubmapInfo&, int, RKRegionWalkState&) {}
 
