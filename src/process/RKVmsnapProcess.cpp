@@ -100,6 +100,7 @@ bool RKVmsnapProcess::initWithVmsnapData(std::string_view bytes, RKError* error)
         RKError::set(error, RKVmsnapErrorDomain, 1, "vmsnap initialization failed with unknown error");
         return false;
     }
+    // The base named it by the live system's rule; the snapshot knows its own name.
     setName(graph_.processName);
     setDisplayString(graph_.processName + " [" + std::to_string(graph_.pid) + "] (vmsnap)");
     return _choosePlatform(error);

@@ -107,6 +107,16 @@ TEST_F(RKVmsnapEndToEnd, BadFilesAndForbiddenProcessesEndInAMessageAndStatus1) {
     RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, file("good", good)});
     EXPECT_TRUE(run.exitedWith(0)) << run.standardError;
     EXPECT_NE(run.standardOutput.find("p [5] (vmsnap): 64-bit"), std::string::npos);
+    // One measurement has one analysis mode: the breakdown's and the VM-object view's do not mix.
+    std::string breakdown = file("breakdown", std::regex_replace(good, std::regex("\"regions\""),
+                                                                 "\"showsPhysMemspread\":true,\"regions\""));
+    run = RKRunCommand({MEMSPREAD_BINARY, "--vmObjectDirty", breakdown});
+    EXPECT_TRUE(run.exitedWith(1));
+    EXPECT_NE(run.standardError.find("Vmsnap was gathered with an analysis mode that conflicts with other vmsnaps or "
+                                     "command line arguments: " + breakdown),
+              std::string::npos)
+        << run.standardError;
+    EXPECT_TRUE(RKRunCommand({MEMSPREAD_BINARY, "--vmObjectDirty", file("good", good)}).exitedWith(0));
 
     if (geteuid() != 0) GTEST_SKIP() << "the rest needs another user";
     std::string secret = file("secret", good);
