@@ -19,6 +19,14 @@ RKSharedString RKUnsharedString(std::string_view text);
 template <size_t Slots>
 class RKStringInternTable {
 public:
+    RKStringInternTable() = default;
+    // The process-wide tables live until exit, when nothing gathers any more.
+    ~RKStringInternTable() {
+        for (auto& slot : slots_) delete slot.load(std::memory_order_acquire);
+    }
+    RKStringInternTable(const RKStringInternTable&) = delete;
+    RKStringInternTable& operator=(const RKStringInternTable&) = delete;
+
     // The interned string equal to `text` (compared on its first `limit` bytes), probing at most
     // `probes` slots from `first` onwards (wrapping); a new unshared string when all of them
     // hold other strings.
