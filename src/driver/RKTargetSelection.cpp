@@ -10,18 +10,9 @@
 #include "model/RKEscapedText.h"
 #include "platform/RKPlatform.h"
 #include "process/RKProcess.h"
+#include "process/RKVmsnapProcess.h"
 
 namespace {
-
-constexpr const char* kSnapshotErrorDomain = "MemspreadErrorDomain";
-
-// Opens a snapshot file as a process. NOT YET BUILT: the snapshot reader comes in a later step,
-// so every file is refused in the reader's own words.
-std::shared_ptr<RKProcess> openVmsnap(const std::string& path, RKError* error) {
-    (void)path;
-    RKError::set(error, kSnapshotErrorDomain, 1, "snapshot files are not supported yet");
-    return nullptr;
-}
 
 // A snapshot's key in the target map: derived from its path (FNV-1a), kept above every pid so
 // a snapshot of a process and the live process can both be targets.
@@ -64,7 +55,7 @@ bool takeVmsnapInputs(RKMemspreadArgs& args, RKTargetMap& vmsnaps, RKError* erro
         struct stat file {};
         if (::stat(path.c_str(), &file) != 0) continue;
         RKError openError;
-        if (auto process = openVmsnap(path, &openError)) {
+        if (std::shared_ptr<RKProcess> process = RKVmsnapProcess::processWithVmsnap(path, &openError)) {
             if (!adoptVmsnap(args, path, std::move(process), vmsnaps, error)) return false;
         } else {
             auto found = RKProcess::pidsForStringDescriptions({path}, nullptr);

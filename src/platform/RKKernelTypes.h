@@ -151,6 +151,19 @@ struct RKSysVSegment {
     uint64_t swapped = 0;
 };
 
+// One segment of one loaded image, as the platform's image lister reports it (the symbol
+// library's owners and segments elsewhere; on Linux the mappings of executable files).
+struct RKImageSegmentRecord {
+    std::string path;       // of the image file
+    uint64_t baseAddress = 0;  // the image's load address
+    uint64_t start = 0;
+    uint64_t size = 0;
+    std::string name;       // the segment's name
+    // The segment code (2 text, 3 data, 4 link-edit) when the platform knows it; 0 when the
+    // name decides.
+    uint8_t segment = 0;
+};
+
 // mach_get_times.
 struct RKClockReadings {
     uint64_t absolute = 0;    // ticks of the uptime clock
@@ -162,4 +175,22 @@ struct RKClockReadings {
 struct RKTimebase {
     uint32_t numer = 1;
     uint32_t denom = 1;
+};
+
+// One range whose page dispositions will be asked for, with what the region walk knows of it:
+// whether its pages are a file's (a clean file page is not memory), and how many of its pages
+// at most were lazily freed (the kernel keeps that count per mapping only).
+struct RKPageQueryRange {
+    uint64_t start = 0;
+    uint64_t size = 0;
+    bool fileBacked = false;
+    uint64_t reusablePages = 0;
+};
+
+// What this system's page queries see.
+struct RKPageQueryAbilities {
+    // Dirty file pages are told from clean ones (on Linux: /proc/kpageflags is readable).
+    bool dirtyFilePages = true;
+    // Physical frame numbers are visible, so pages can be identified across processes.
+    bool frames = false;
 };

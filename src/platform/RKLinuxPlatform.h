@@ -26,15 +26,19 @@ public:
     std::optional<std::string> taskExecutablePath(RKTask& task) override;
     bool hasSharedRegion() override;
 
-    // Address space (RKLinuxRegions.cpp).
+    // Address space (RKLinuxRegions.cpp; page queries RKLinuxPages.cpp).
     kern_return_t regionRecurse(RKTask& task, uint64_t& address, uint64_t& size,
                                 RKRegionSubmapInfo& info, uint32_t& count) override;
     kern_return_t region(RKTask& task, uint64_t& address, uint64_t& size,
                          RKRegionBasicInfo& info) override;
     kern_return_t purgableState(RKTask& task, uint64_t address, int& state) override;
     std::optional<std::string> regionFileName(RKTask& task, uint64_t address) override;
+    kern_return_t imageSegments(RKTask& task, std::vector<RKImageSegmentRecord>& segments) override;
     kern_return_t pageRangeQuery(RKTask& task, uint64_t address, uint64_t size,
                                  uint32_t* dispositions, uint64_t& count) override;
+    // Page queries (RKLinuxPages.cpp).
+    void preparePageRangeQueries(RKTask& task, const std::vector<RKPageQueryRange>& ranges) override;
+    RKPageQueryAbilities pageQueryAbilities() override;
 
     // Per-process figures (RKLinuxFigures.cpp).
     int pidRusage(RKTask& task, RKRusageInfo& info) override;

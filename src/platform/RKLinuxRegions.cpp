@@ -35,8 +35,10 @@ kern_return_t RKLinuxPlatform::regionRecurse(RKTask& task, uint64_t& address, ui
                                              RKRegionSubmapInfo& info, uint32_t& count) {
     RKLinuxTask* target = linuxTask(task);
     if (!target) return KERN_INVALID_ARGUMENT;
-    kern_return_t result = ensureSnapshot(*this, *target, address == 0);
+    bool fresh = address == 0 && !(target->snapshot && target->snapshot->readyForWalk);
+    kern_return_t result = ensureSnapshot(*this, *target, fresh);
     if (result != KERN_SUCCESS) return result;
+    target->snapshot->readyForWalk = false;
     const RKLinuxRegion* region = regionEndingAbove(*target->snapshot, address);
     if (!region) {
         result = target->snapshot->end;
@@ -81,9 +83,4 @@ std::optional<std::string> RKLinuxPlatform::regionFileName(RKTask& task, uint64_
     const RKLinuxRegion* region = regionContaining(*target->snapshot, address);
     if (!region || region->detail.empty()) return std::nullopt;
     return std::string(region->detail);
-}
-
-kern_return_t RKLinuxPlatform::pageRangeQuery(RKTask&, uint64_t, uint64_t, uint32_t*, uint64_t& count) {
-    count = 0;
-    return KERN_FAILURE;
 }

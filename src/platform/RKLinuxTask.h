@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "platform/RKDescriptorBudget.h"
+#include "platform/RKLinuxPageReader.h"
 #include "platform/RKLinuxVmaClassifier.h"
 #include "platform/RKPlatform.h"
 #include "platform/RKSmapsParser.h"
@@ -29,6 +30,9 @@ struct RKLinuxWalkSnapshot {
     // What follows the last region: KERN_INVALID_ADDRESS, or MACH_SEND_INVALID_DEST when the
     // process went away while it was read (the regions may then be only a prefix).
     kern_return_t end = KERN_INVALID_ADDRESS;
+    // Read for the image lister just before a walk: the walk that starts next uses it instead
+    // of reading smaps again.
+    bool readyForWalk = false;
 };
 
 class RKLinuxTask : public RKTask {
@@ -42,6 +46,8 @@ public:
 
     // Set while a walk is under way (RKLinuxRegions.cpp); dropped when it reaches the end.
     std::unique_ptr<RKLinuxWalkSnapshot> snapshot;
+    // Page data read ahead for the page queries that follow (RKLinuxPages.cpp).
+    std::unique_ptr<RKLinuxPageData> pageData;
 
 private:
     pid_t pid_;

@@ -77,10 +77,19 @@ public:
     virtual kern_return_t purgableState(RKTask& task, uint64_t address, int& state) = 0;
     // proc_regionfilename: the path of the file mapped at `address`, nothing when none.
     virtual std::optional<std::string> regionFileName(RKTask& task, uint64_t address) = 0;
+    // The segments of the task's loaded images, in no particular order: KERN_SUCCESS, or the
+    // failure code of reading the address space.
+    virtual kern_return_t imageSegments(RKTask& task, std::vector<RKImageSegmentRecord>& segments) = 0;
     // mach_vm_page_range_query: one disposition word per page of [address, address + size).
     // `count` is in: room in `dispositions`, out: the number written.
     virtual kern_return_t pageRangeQuery(RKTask& task, uint64_t address, uint64_t size,
                                          uint32_t* dispositions, uint64_t& count) = 0;
+    // Reads the page data of `ranges` (ascending, disjoint) in one pass, so that the
+    // pageRangeQuery calls that follow inside them are answered without reading again. An empty
+    // list releases what was read. A failure here shows in those queries.
+    virtual void preparePageRangeQueries(RKTask& task, const std::vector<RKPageQueryRange>& ranges) = 0;
+    // What page queries can tell on this system; probed once per run.
+    virtual RKPageQueryAbilities pageQueryAbilities() = 0;
 
     // ---- Per-process figures ----
     // proc_pid_rusage: 0, or the errno of the failure.

@@ -154,6 +154,15 @@ std::optional<std::string> RKScriptedPlatform::regionFileName(RKTask& task, uint
     return region->path;
 }
 
+kern_return_t RKScriptedPlatform::imageSegments(RKTask& task, std::vector<RKImageSegmentRecord>& segments) {
+    record("imageSegments", task.pid());
+    auto* process = find(task.pid());
+    if (!process) return MACH_SEND_INVALID_DEST;
+    if (process->imagesResult != KERN_SUCCESS) return process->imagesResult;
+    segments = process->images;
+    return KERN_SUCCESS;
+}
+
 kern_return_t RKScriptedPlatform::pageRangeQuery(RKTask& task, uint64_t address, uint64_t size,
                                                  uint32_t* dispositions, uint64_t& count) {
     record("pageRangeQuery", task.pid());
@@ -168,6 +177,14 @@ kern_return_t RKScriptedPlatform::pageRangeQuery(RKTask& task, uint64_t address,
     count = pages;
     return KERN_SUCCESS;
 }
+
+void RKScriptedPlatform::preparePageRangeQueries(RKTask& task, const std::vector<RKPageQueryRange>& ranges) {
+    record("preparePageRangeQueries", task.pid());
+    std::lock_guard lock(mutex_);
+    if (auto* process = find(task.pid())) process->preparedRanges.push_back(ranges);
+}
+
+RKPageQueryAbilities RKScriptedPlatform::pageQueryAbilities() { return pageAbilities; }
 
 int RKScriptedPlatform::pidRusage(RKTask& task, RKRusageInfo& info) {
     record("pidRusage", task.pid());

@@ -33,9 +33,14 @@ struct RKScriptedProcess {
     // the normal end; anything else is a failed walk).
     std::vector<RKScriptedRegion> regions;
     kern_return_t walkEnd = KERN_INVALID_ADDRESS;
+    // What the image lister answers.
+    std::vector<RKImageSegmentRecord> images;
+    kern_return_t imagesResult = KERN_SUCCESS;
     // Page dispositions by page address; pages not listed answer 0. pageQueryResult != 0 fails.
     std::map<uint64_t, uint32_t> dispositions;
     kern_return_t pageQueryResult = KERN_SUCCESS;
+    // The ranges of every preparePageRangeQueries call, in order (an empty list releases).
+    std::vector<std::vector<RKPageQueryRange>> preparedRanges;
     int rusageErrno = 0;
     RKRusageInfo rusage;
     int ledgerErrno = 0;
@@ -79,6 +84,7 @@ public:
     uint64_t uptime = 0;
     std::vector<std::string> ledgerNames{"page_table"};
     int ledgerTemplateErrno = 0;
+    RKPageQueryAbilities pageAbilities;
     int32_t selfRegionValue = 0;
     int selfRegionReadErrno = 0;
     int selfRegionWriteErrno = 0;
@@ -112,8 +118,11 @@ public:
                          RKRegionBasicInfo& info) override;
     kern_return_t purgableState(RKTask& task, uint64_t address, int& state) override;
     std::optional<std::string> regionFileName(RKTask& task, uint64_t address) override;
+    kern_return_t imageSegments(RKTask& task, std::vector<RKImageSegmentRecord>& segments) override;
     kern_return_t pageRangeQuery(RKTask& task, uint64_t address, uint64_t size,
                                  uint32_t* dispositions, uint64_t& count) override;
+    void preparePageRangeQueries(RKTask& task, const std::vector<RKPageQueryRange>& ranges) override;
+    RKPageQueryAbilities pageQueryAbilities() override;
     int pidRusage(RKTask& task, RKRusageInfo& info) override;
     int ledgerTemplate(std::vector<std::string>& names) override;
     int ledgerEntries(RKTask& task, std::vector<int64_t>& balances) override;

@@ -16,6 +16,7 @@
 #include "process/RKProcess.h"
 
 class RKImage;
+class RKImageEnumerator;
 class RKMemoryRegion;
 
 // One entry of the address-space walk: start, size, the region record, the purge state
@@ -29,6 +30,18 @@ using RKRegionCallback =
 // Owned VM objects by object id; absent when there is no list at all.
 using RKOwnedVmObjectMap = std::map<uint64_t, RKOwnedVmObjectRecord>;
 
+// A region to split into subranges after the walk, with what its page query needs.
+struct RKSubrangeCandidate {
+    std::shared_ptr<RKMemoryRegion> region;
+    int purgeState = VM_PURGABLE_DENY;
+    RKPageQueryRange range;
+};
+
+// Receives one chunk of page dispositions: the dispositions, how many, the chunk's index and
+// the number of chunks.
+using RKDispositionChunkBlock =
+    std::function<void(const uint32_t* dispositions, uint64_t count, uint64_t chunk, uint64_t chunks)>;
+
 // What one region-building pass carries from region to region and into the steps after it.
 struct RKRegionWalkState {
     RKRegionList regions;
@@ -41,6 +54,11 @@ struct RKRegionWalkState {
     bool hidden = false;
     bool breakDown = false;
     bool sharingAnalysisDisabled = false;
+    // Over the process's images, in ascending address order for the whole walk.
+    std::shared_ptr<RKImageEnumerator> imageEnumerator;
+    // Regions waiting for their subranges until the walk is over, so that the process's page
+    // data is read once, for these regions only (RKUserProcessPages.cpp).
+    std::vector<RKSubrangeCandidate> subrangeCandidates;
 };
 
 // Architectures that decide where the shared library cache is mapped.
@@ -103,26 +121,44 @@ public:
     virtual void _gatherIdleExitStatus();
     void _setIdleExitStatusFromDirtyFlags(uint32_t flags);
 
-    // ---- Steps filled in by later sources of the process's memory ----
-    // Sizes a region from page dispositions instead of the region counters. Not yet: true.
+    // ---- Page dispositions (RKUserProcessPages.cpp) ----
+    // Asks for the dispositions of `pagesToQuery` pages from the page-aligned `startAddr`, at
+    // most 4096 pages a call, handing each chunk to `block`. False, after an error or (for a
+    // process that exited) a warning, when a query failed.
+    virtual bool _enumerateDispositionChunks(uint64_t startAddr, uint64_t pagesToQuery,
+                                             const RKDispositionChunkBlock& block);
+    // Sizes a region (dirty and swapped, which must be 0) from page dispositions instead of the
+    // region counters. A page shared with the previous region is taken from the disposition
+    // cache, and an unused shared-cache region is charged its part of the page it shares with
+    // the next. False when a query failed; what was counted stays.
     virtual bool _populateMemoryRegionWithPageQueries(RKMemoryRegion& region, const RKRegionSubmapInfo& info);
-    // Splits a mixed region into per-page-state runs. Not yet: no subranges.
+    // Splits a region into runs of pages of one state, in object-offset space.
     virtual void _addSubrangesForRegion(RKMemoryRegion& region, int purgeState);
-    // Reads the loaded images. Not yet: none, so no region is named after an image.
-    virtual void _gatherImageData() {}
-    // Names a region after the image segment it lies in. Not yet: false.
-    virtual bool _nameRegionFromImages(RKMemoryRegion& region, RKRegionWalkState& state);
+    // Rule 7 of the region callback: notes an eligible region for its subranges.
+    void _addSubrangesIfEligible(const std::shared_ptr<RKMemoryRegion>& region, const RKRegionSubmapInfo& info,
+                                 int purgeState, RKRegionWalkState& state);
+    // After the walk: reads the noted regions' page data at once and builds their subranges.
+    void _addPendingSubranges(RKRegionWalkState& state);
+
+    // Reads the loaded images into `images`, sorted by start (RKUserProcessImages.cpp).
+    virtual void _gatherImageData();
+    // Names a region after the image segment it lies in; false when it lies in none.
+    bool _nameRegionFromImages(RKMemoryRegion& region, RKRegionWalkState& state);
+    // Cuts an entry of the shared region into one region per image segment and one per gap
+    // between segments, into `state.regions` (RKUserProcessSharedRegion.cpp). False when a page
+    // query failed.
+    bool _addRegionsToArray(RKRegionWalkState& state, uint64_t start, uint64_t size, const RKRegionSubmapInfo& info);
+
     // The VM objects the task owns (RKUserProcessOwned.cpp); none with the breakdown off, when
     // the platform has no list, or when it could not be read.
     virtual std::optional<RKOwnedVmObjectMap> _gatherOwnedVmObjects();
-    // Cuts an entry of the shared region at image boundaries into `state.regions`; false when a
-    // page query failed. Not yet: the entry is skipped (no shared region on this platform).
-    virtual bool _addRegionsToArray(RKRegionWalkState& state, uint64_t start, uint64_t size,
-                                    const RKRegionSubmapInfo& info);
     // Charges a tag-named region from the owned-object list, or without a list a purgeable one
     // from its own counters.
     virtual void _chargeOwnedObjectForRegion(RKMemoryRegion& region, const RKRegionSubmapInfo& info,
                                              int purgeState, RKRegionWalkState& state);
+    // Completes a region after it was sized and named, for sources that saved more than the
+    // region record (a Linux snapshot). The live walk has nothing to add.
+    virtual void _completeRegion(RKMemoryRegion&) {}
     // Appends a region without an address for every owned object the walk did not meet.
     virtual void _addUnconsumedOwnedObjectRegions(RKRegionWalkState& state);
     // One warning for each SysV segment that nobody maps and whose creator is gone: memory that
@@ -157,6 +193,14 @@ protected:
     // The start time of the listed process, which a task must reach.
     uint64_t listedStartSeconds_ = 0;
     uint64_t listedStartMicroseconds_ = 0;
+    // The disposition of the last page of the latest region sized from dispositions whose end
+    // is not page-aligned, and that page's address (0: none).
+    uint64_t cachedDispositionAddress_ = 0;
+    uint32_t cachedDisposition_ = 0;
+    // An unused shared-cache region waiting for the disposition of its last, partial page.
+    // Not owned: the region lives in the walk's region list until the walk is over.
+    RKMemoryRegion* pendingUnusedSharedRegion_ = nullptr;
+    bool pageQueryFailed_ = false;  // a page query failed: the process is gone or unreadable
 
 private:
     // task_for_pid and the start-time check; the task is kept only on success.

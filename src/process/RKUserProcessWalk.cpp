@@ -8,6 +8,7 @@
 #include "model/RKEscapedText.h"
 #include "model/RKMemoryRegion.h"
 #include "process/RKAnalysisSettings.h"
+#include "process/RKImage.h"
 #include "process/RKUserProcess.h"
 
 namespace {
@@ -134,6 +135,21 @@ bool RKUserProcess::_walkStep(uint64_t& address, uint64_t last, bool& pseudoRegi
             if (count <= kRecordCountBeforeFullObjectId) info.object_id_full = info.object_id;
             // Nothing after the owned-memory pseudo-region belongs to the address space.
             if (info.user_tag != RK_OWNED_MEMORY_TAG && pseudoRegionSeen) return false;
+            // The bisection missed what lies below the shared region, so the recursion reached
+            // into it: that entry's record must come from the top level all the same.
+            if (start >= sharedRegionBase_ && start < sharedEnd) {
+                RKRegionBasicInfo basic;
+                const uint64_t entry = start;
+                result = platform.region(*task_, start, size, basic);
+                if (result == KERN_SUCCESS && start <= entry) {
+                    size -= std::min(size, entry - start);
+                    start = entry;
+                    info = sharedRegionRecord(basic);
+                    inSharedRegion = true;
+                } else if (result != KERN_SUCCESS) {
+                    failedCall = "mach_vm_region";
+                }
+            }
         } else {
             failedCall = "mach_vm_region_recurse";
         }
@@ -163,11 +179,13 @@ void RKUserProcess::_gatherMemoryData() {
     state.hidden = hiddenFromDisplay();
     state.breakDown = breakDownPhysMemspread();
     state.sharingAnalysisDisabled = RKAnalysisSettings::isSharingAnalysisDisabled();
+    if (images_) state.imageEnumerator = std::make_shared<RKImageEnumerator>(*images_);
     enumerateRegions([&](uint64_t start, uint64_t size, const RKRegionSubmapInfo& info, int purgeState,
                          const std::optional<std::string>& path, const std::optional<std::string>& name,
                          bool verbose) {
         return _addRegionForEntry(state, start, size, info, purgeState, path, name, verbose);
     });
+    _addPendingSubranges(state);
     _addUnconsumedOwnedObjectRegions(state);
     ownedVmObjects_.reset();
     _reconcileUnmappedOwnedRegion(state);
@@ -205,10 +223,9 @@ bool RKUserProcess::_addRegionForEntry(RKRegionWalkState& state, uint64_t start,
     region->segment = RKSegmentNoImage;
     region->verbose = verbose;
     _nameRegion(*region, info, purgeState, path, name, state);
+    _completeRegion(*region);
 
-    if (state.breakDown && !state.sharingAnalysisDisabled && !state.hidden &&
-        region->eligibleForSubrangesUsingPageSize(pageSize()))
-        _addSubrangesForRegion(*region, purgeState);
+    _addSubrangesIfEligible(region, info, purgeState, state);
     if (region != state.unmappedOwnedRegion) state.regions.push_back(std::move(region));
     return false;
 }
@@ -303,14 +320,4 @@ void RKUserProcess::_addErrnoWarningWithDescription(const std::string& descripti
 }
 
 // ---- Steps that later sources of the process's memory fill in ----
-
-bool RKUserProcess::_populateMemoryRegionWithPageQueries(RKMemoryRegion&, const RKRegionSubmapInfo&) { return true; }
-
-void RKUserProcess::_addSubrangesForRegion(RKMemoryRegion&, int) {}
-
-bool RKUserProcess::_nameRegionFromImages(RKMemoryRegion&, RKRegionWalkState&) { return false; }
-
-bool RKUserProcess::_addRegionsToArray(RKRegionWalkState&, uint64_t, uint64_t, const RKRegionSubmapInfo&) {
-    return true;
-}
 

@@ -8,3 +8,5 @@
 // to a directory every user can enter, since the build tree may sit below one only root can
 // (a checkout in a private temporary directory, for example).
 std::vector<std::string> RKCommandAsNobody(const std::vector<std::string>& arguments);
+// The same for the vmsnap binary.
+std::vector<std::string> RKVmsnapCommandAsNobody(const std::vector<std::string>& arguments);

@@ -1,0 +1,61 @@
+// Page queries on Linux: answered from the page data read ahead for the ranges a process is
+// about to ask for, or read on the spot for a range nobody announced.
+#include <algorithm>
+
+#include "platform/RKLinuxPlatform.h"
+#include "platform/RKLinuxTask.h"
+
+namespace {
+
+// What the walk knows of the VMA at `address`, for a range read without announcement.
+RKPageQueryRange unannouncedRange(const RKLinuxTask& task, uint64_t address, uint64_t size) {
+    RKPageQueryRange range{address, size, false, 0};
+    if (!task.snapshot) return range;
+    for (const RKLinuxRegion& region : task.snapshot->regions) {
+        if (region.vma.start <= address && address < region.vma.end) {
+            range.fileBacked = region.kind == RKVmaKind::File;
+            range.reusablePages = region.info.pages_reusable;
+        }
+    }
+    return range;
+}
+
+}  // namespace
+
+void RKLinuxPlatform::preparePageRangeQueries(RKTask& task, const std::vector<RKPageQueryRange>& ranges) {
+    auto* target = dynamic_cast<RKLinuxTask*>(&task);
+    if (!target) return;
+    target->pageData.reset();
+    if (ranges.empty()) return;
+    target->pageData = std::make_unique<RKLinuxPageData>();
+    RKReadPageData(target->directoryFd(), procRoot(), kernelPageSize(), ranges, *target->pageData);
+}
+
+kern_return_t RKLinuxPlatform::pageRangeQuery(RKTask& task, uint64_t address, uint64_t size, uint32_t* dispositions,
+                                              uint64_t& count) {
+    auto* target = dynamic_cast<RKLinuxTask*>(&task);
+    const uint64_t page = kernelPageSize();
+    const uint64_t pages = std::min(count, (size + page - 1) / page);
+    count = 0;
+    if (!target) return KERN_INVALID_ARGUMENT;
+    std::span<uint32_t> out(dispositions, pages);
+    if (target->pageData) {
+        if (target->pageData->answer(address, page, out)) {
+            count = pages;
+            return KERN_SUCCESS;
+        }
+        if (target->pageData->result != KERN_SUCCESS) return target->pageData->result;
+    }
+    RKLinuxPageData data;
+    kern_return_t result =
+        RKReadPageData(target->directoryFd(), procRoot(), page, {unannouncedRange(*target, address, size)}, data);
+    if (result != KERN_SUCCESS) return result;
+    if (!data.answer(address, page, out)) return KERN_FAILURE;
+    count = pages;
+    return KERN_SUCCESS;
+}
+
+RKPageQueryAbilities RKLinuxPlatform::pageQueryAbilities() {
+    const RKLinuxPageProbe& probe = RKProbePageReading(procRoot());
+    return RKPageQueryAbilities{probe.kpageflags, probe.kpageflags};
+}

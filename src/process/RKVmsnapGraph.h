@@ -1,0 +1,100 @@
+// A saved process (a vmsnap file) as plain records: what the snapshot source reads in place of a
+// live task. docs/vmsnap.md describes the file; RKVmsnapParse and RKVmsnapSerialize are its only
+// readers and writers, functions between bytes and these records with no I/O of their own.
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "model/RKError.h"
+
+// The file version this program writes and the newest it reads.
+inline constexpr int64_t RKVmsnapVersion = 1;
+
+// One run of pages in one state, in the region's object-offset space.
+struct RKVmsnapSubrange {
+    uint64_t offset = 0;
+    uint64_t length = 0;
+    uint64_t dirty = 0;
+    uint64_t swapped = 0;
+    uint64_t clean = 0;
+    uint64_t reclaimable = 0;
+    uint64_t wired = 0;
+};
+
+// What a Linux snapshot adds to a region record, so that the analysis sees the region exactly as
+// the live run built it (its name, detail, exact sizes, subranges and flags).
+struct RKVmsnapRegionDetails {
+    std::string name;
+    std::string detail;
+    uint64_t dirty = 0;
+    uint64_t swapped = 0;
+    uint64_t clean = 0;
+    uint64_t reclaimable = 0;
+    bool wired = false;
+    bool ownedExclusivelyByParentProcess = false;
+    std::vector<RKVmsnapSubrange> subranges;
+};
+
+// One mapped region, with the counters a region query answers (sizes in bytes).
+struct RKVmsnapRegion {
+    uint64_t address = 0;
+    uint64_t length = 0;
+    int32_t prot = 0;
+    int32_t maxProt = 0;
+    uint64_t offset = 0;
+    uint32_t user_tag = 0;
+    uint64_t resident_size = 0;
+    uint64_t shared_now_private_size = 0;
+    uint64_t swapped_out_size = 0;
+    uint64_t dirty_size = 0;
+    uint64_t reusable_size = 0;
+    uint16_t ref_count = 0;
+    bool external_pager = false;
+    uint8_t share_mode = 0;
+    bool is_submap = false;
+    uint64_t object_id = 0;
+    int32_t purgeable = 3;  // VM_PURGABLE_DENY: not purgeable
+    std::string path;
+    std::string type;       // a segment name, a reserved area's name, or empty
+    uint8_t segment = 0;    // the segment code of an image segment whose name is not a "__" name
+    std::optional<RKVmsnapRegionDetails> details;
+};
+
+// Memory the process holds without an address (owned objects, page tables), as the live run
+// built it.
+struct RKVmsnapUnaddressedRegion {
+    uint64_t size = 0;
+    uint32_t user_tag = 0;
+    uint64_t object_id = 0;
+    uint8_t share_mode = 0;
+    uint64_t offset = 0;
+    RKVmsnapRegionDetails details;
+};
+
+struct RKVmsnapGraph {
+    int64_t version = RKVmsnapVersion;
+    bool is64bit = true;
+    int32_t pid = 0;
+    std::string processName;
+    std::string processDescriptionString;
+    std::string binaryImagesDescription;
+    uint64_t vmPageSize = 0;
+    uint64_t physicalMemspread = 0;
+    uint64_t physicalMemspreadPeak = 0;
+    bool showsPhysMemspread = false;
+    std::vector<RKVmsnapRegion> regions;  // ascending by address
+    std::vector<RKVmsnapUnaddressedRegion> unaddressedRegions;
+};
+
+inline constexpr const char* RKVmsnapErrorDomain = "MemspreadErrorDomain";
+
+// The graph of a file's bytes (compressed or plain JSON), or nothing with an error of the
+// snapshot domain saying what is wrong. Never throws.
+std::optional<RKVmsnapGraph> RKVmsnapParse(std::string_view bytes, RKError* error);
+
+// The file's bytes for a graph: JSON, compressed.
+std::string RKVmsnapSerialize(const RKVmsnapGraph& graph);

@@ -1,0 +1,195 @@
+// Page-level accounting of live processes: a parent and a child that each wrote half of a
+// memfd and of a shared file count each object once and whole, each process's sharing block
+// holds its own half, and subranges of zero-page, lazily freed and locked memory agree with the
+// kernel's own counts.
+#include <gtest/gtest.h>
+#include <fcntl.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <csignal>
+#include <fstream>
+#include <map>
+#include <regex>
+
+#include "model/RKMemoryRegion.h"
+#include "model/RKRangeList.h"
+#include "process/RKAnalysisSettings.h"
+#include "process/RKUserProcess.h"
+#include "support/RKFixtureProcess.h"
+#include "support/RKRunCommand.h"
+#include "support/RKUnprivileged.h"
+
+namespace {
+
+const uint64_t P = static_cast<uint64_t>(sysconf(_SC_PAGESIZE));
+const uint64_t MiB = 1 << 20;
+
+// The Dirty column by category of the table after the first `heading` at or after `from`.
+std::map<std::string, uint64_t> dirtyByCategory(const std::string& report, const std::string& heading, size_t from = 0) {
+    static const std::regex row(R"(^ *(\d+) B +\d+ B +\d+ B +\d+    (.+)$)");
+    std::map<std::string, uint64_t> rows;
+    for (const std::string& line : RKSplitLines(report.substr(std::min(report.find(heading, from), report.size())))) {
+        std::smatch match;
+        if (!rows.count("TOTAL") && std::regex_match(line, match, row)) rows[match[2]] = std::stoull(match[1]);
+    }
+    return rows;
+}
+
+// A "Name: N kB" field, in bytes, of the smaps entry at `address` (or of a status-like file).
+uint64_t kernelField(const std::string& file, const std::string& field, uint64_t address = 0) {
+    std::ifstream in(file);
+    std::string line;
+    bool inside = address == 0;
+    while (std::getline(in, line)) {
+        unsigned long long start = 0, end = 0;
+        if (std::sscanf(line.c_str(), "%llx-%llx ", &start, &end) == 2) inside = address == 0 || start == address;
+        if (inside && line.rfind(field + ":", 0) == 0) return std::stoull(line.substr(field.size() + 1)) * 1024;
+    }
+    return 0;
+}
+
+const RKMemoryRegion* regionAt(const RKProcess& process, uint64_t address) {
+    for (const auto& region : process.memoryRegions().value_or(RKRegionList{}))
+        if (region->start == address) return region.get();
+    return nullptr;
+}
+
+// The process measured in-process, as the program measures it (breakdown on).
+std::shared_ptr<RKProcess> gathered(pid_t pid) {
+    RKAnalysisSettings::setBreakDownPhysMemspread(true);
+    auto process = RKProcess::processWithPid(pid);
+    if (process) process->gatherData();
+    return process;
+}
+
+TEST(RKPageLevel, HalvesWrittenByParentAndChildCountOnceEach) {
+    RKFixtureProcess fixture;
+    ASSERT_TRUE(fixture.start(MEMSPREAD_HALVES_FIXTURE)) << fixture.error();
+    const std::string parent = std::to_string(fixture.pid()), child = std::to_string(fixture.childPid());
+    RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", parent, child});
+    ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
+    const std::string& report = run.standardOutput;
+    // memfd_halves whole (16 MiB) and the touched half of memfd_half.
+    EXPECT_EQ(dirtyByCategory(report, "Summary Memspread: ")["memfd"], 16 * MiB + 8 * MiB) << report;
+    EXPECT_EQ(dirtyByCategory(report, "Shared with ", report.find("[" + parent + "]: 64-bit"))["memfd"], 16 * MiB);
+    EXPECT_EQ(dirtyByCategory(report, "Shared with ", report.find("[" + child + "]: 64-bit"))["memfd"], 8 * MiB);
+    if (geteuid() != 0) return;
+    // file_halves whole, beside a few pages of the program's own libraries.
+    uint64_t files = dirtyByCategory(report, "Summary Memspread: ")["mapped file"];
+    EXPECT_GE(files, 16 * MiB + 8 * P);
+    EXPECT_LT(files, 18 * MiB) << report;
+    EXPECT_GE(dirtyByCategory(report, "Shared with ", report.find("[" + child + "]: 64-bit"))["mapped file"], 8 * MiB);
+}
+
+TEST(RKPageLevel, SubrangesAgreeWithTheKernelsCounts) {
+    RKFixtureProcess fixture;
+    ASSERT_TRUE(fixture.start(MEMSPREAD_HALVES_FIXTURE)) << fixture.error();
+    auto parent = gathered(fixture.pid());
+    ASSERT_TRUE(parent);
+    const std::string smaps = "/proc/" + std::to_string(fixture.pid()) + "/smaps";
+
+    const RKMemoryRegion* zeroRead = regionAt(*parent, fixture.area("anon_zero_read")->address);
+    ASSERT_TRUE(zeroRead && zeroRead->subrangeList());
+    EXPECT_EQ(zeroRead->subrangeList()->sum().dirty, 8 * P) << "pages only read map the zero page: nothing dirty";
+
+    if (geteuid() != 0) GTEST_SKIP() << "lazily freed pages and dirty file pages need /proc/kpageflags";
+    const uint64_t lazyAddress = fixture.area("anon_lazy_free")->address;
+    const RKMemoryRegion* lazy = regionAt(*parent, lazyAddress);
+    ASSERT_TRUE(lazy && lazy->subrangeList());
+    EXPECT_EQ(lazy->subrangeList()->sum().reclaimable, kernelField(smaps, "LazyFree", lazyAddress));
+    EXPECT_GT(lazy->subrangeList()->sum().reclaimable, 0u);
+
+    const uint64_t lockedAddress = fixture.area("locked_file")->address;
+    const RKMemoryRegion* locked = regionAt(*parent, lockedAddress);
+    ASSERT_TRUE(locked);
+    EXPECT_EQ(locked->wiredSize(), kernelField(smaps, "Locked", lockedAddress));
+    if (locked->subrangeList()) {
+        EXPECT_EQ(locked->subrangeList()->sum().wired, 16 * P) << "every run is wired";
+    }
+}
+
+TEST(RKPageLevel, MemfdHalvesWithoutRoot) {
+    if (geteuid() != 0) GTEST_SKIP() << "needs root to run the fixture and the binary as nobody";
+    RKFixtureProcess fixture;
+    ASSERT_TRUE(fixture.start(MEMSPREAD_HALVES_FIXTURE, {"--as-nobody"})) << fixture.error();
+    RKCommandResult run = RKRunCommand(RKCommandAsNobody({"-f", "bytes", std::to_string(fixture.pid()),
+                                                          std::to_string(fixture.childPid())}));
+    ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
+    EXPECT_EQ(dirtyByCategory(run.standardOutput, "Summary Memspread: ")["memfd"], 16 * MiB + 8 * MiB) << run.standardOutput;
+}
+
+// The process is killed and reaped after its walk, before its page data is read.
+class RKExitsAfterWalk : public RKUserProcess {
+public:
+    void enumerateRegions(const RKRegionCallback& callback) override {
+        RKUserProcess::enumerateRegions(callback);
+        ::kill(pid(), SIGKILL);
+        ::waitpid(pid(), nullptr, 0);
+    }
+};
+
+TEST(RKPageLevel, ProcessThatExitsBeforeItsPageQueryIsAWarning) {
+    int input[2], output[2];
+    ASSERT_EQ(pipe(input), 0);
+    ASSERT_EQ(pipe(output), 0);
+    pid_t child = fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+        dup2(input[0], STDIN_FILENO);
+        dup2(output[1], STDOUT_FILENO);
+        execl(MEMSPREAD_HALVES_FIXTURE, MEMSPREAD_HALVES_FIXTURE, "/tmp", static_cast<char*>(nullptr));
+        _exit(127);
+    }
+    close(input[0]);
+    close(output[1]);
+    // Ready once it says so: every area written (its standard input stays open till then).
+    std::string said;
+    char buffer[512];
+    for (ssize_t n; said.find("ready\n") == std::string::npos && (n = read(output[0], buffer, sizeof buffer)) > 0;)
+        said.append(buffer, static_cast<size_t>(n));
+    close(output[0]);
+    RKAnalysisSettings::setBreakDownPhysMemspread(true);
+    auto process = std::make_shared<RKExitsAfterWalk>();
+    ASSERT_TRUE(process->initWithBsdInfo(*RKPlatform::current().bsdInfo(child)));
+    testing::internal::CaptureStderr();
+    process->gatherData();
+    testing::internal::GetCapturedStderr();
+    ASSERT_EQ(process->warnings().size(), 1u);
+    EXPECT_TRUE(process->warnings().front().ends_with(" (process exited)")) << process->warnings().front();
+    EXPECT_TRUE(process->errors().empty());
+    EXPECT_TRUE(process->memoryRegions()) << "the run goes on with the regions of the walk";
+    close(input[1]);
+}
+
+}  // namespace
+
+namespace {
+
+// Each process's memspread is the kernel's own figure (RssAnon + RssShmem + VmSwap − LazyFree,
+// plus its page tables) and the dirty pages of the files it maps shared, which the kernel's
+// figure leaves to the page cache.
+TEST(RKPageLevel, MemspreadEqualsTheKernelsFigure) {
+    RKFixtureProcess fixture;
+    ASSERT_TRUE(fixture.start(MEMSPREAD_FIXTURE)) << fixture.error();
+    const std::string parent = std::to_string(fixture.pid()), child = std::to_string(fixture.childPid());
+    RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", parent, child});
+    ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
+    for (const std::string& pid : {parent, child}) {
+        SCOPED_TRACE(pid);
+        const std::string proc = "/proc/" + pid;
+        uint64_t kernel = kernelField(proc + "/status", "RssAnon") + kernelField(proc + "/status", "RssShmem") +
+                          kernelField(proc + "/status", "VmSwap") + kernelField(proc + "/status", "VmPTE") -
+                          kernelField(proc + "/smaps_rollup", "LazyFree");
+        if (pid == parent) {
+            uint64_t shared = fixture.area("file_shared")->address;
+            kernel += kernelField(proc + "/smaps", "Shared_Dirty", shared) + kernelField(proc + "/smaps", "Private_Dirty", shared);
+        }
+        std::smatch match;
+        std::regex header("\\[" + pid + "\\]: 64-bit\tMemspread: (\\d+) B");
+        ASSERT_TRUE(std::regex_search(run.standardOutput, match, header));
+        EXPECT_EQ(std::stoull(match[1]), kernel);
+    }
+}
+
+}  // namespace

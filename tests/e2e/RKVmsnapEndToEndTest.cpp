@@ -1,0 +1,153 @@
+// Snapshots end to end: `vmsnap` saves stopped fixture processes and memspread reports the files
+// exactly as it reports the processes; damaged, foreign and unreadable files, and processes the
+// user may not read, end in a clear message and status 1 without a file left behind.
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+#include <regex>
+
+#include "support/RKFixtureProcess.h"
+#include "support/RKRunCommand.h"
+#include "support/RKUnprivileged.h"
+
+namespace fs = std::filesystem;
+
+namespace {
+
+class RKVmsnapEndToEnd : public ::testing::Test {
+protected:
+    void SetUp() override {
+        directory_ = fs::temp_directory_path() / ("memspread-vmsnap-" + std::to_string(getpid()));
+        fs::create_directories(directory_);
+        ::chmod(directory_.c_str(), 0755);
+    }
+    void TearDown() override { fs::remove_all(directory_); }
+    std::string file(const std::string& name, const std::string& contents) const {
+        std::string path = (directory_ / name).string();
+        std::ofstream(path, std::ios::binary) << contents;
+        return path;
+    }
+    fs::path directory_;
+};
+
+std::string withoutVmsnapMarks(const std::string& report) { return std::regex_replace(report, std::regex(" \\(vmsnap\\)"), ""); }
+
+// Stops a process for the life of the object, so that two measurements see the same memory.
+struct Stopped {
+    explicit Stopped(std::vector<pid_t> pids) : pids_(std::move(pids)) {
+        for (pid_t pid : pids_) ::kill(pid, SIGSTOP);
+    }
+    ~Stopped() {
+        for (pid_t pid : pids_) ::kill(pid, SIGCONT);
+    }
+    std::vector<pid_t> pids_;
+};
+
+}  // namespace
+
+TEST_F(RKVmsnapEndToEnd, SavedStoppedProcessesReportLikeTheLiveOnes) {
+    RKFixtureProcess fixture;
+    ASSERT_TRUE(fixture.start(MEMSPREAD_FIXTURE)) << fixture.error();
+    const std::string parent = std::to_string(fixture.pid()), child = std::to_string(fixture.childPid());
+    Stopped stopped({fixture.pid(), fixture.childPid()});
+
+    const std::string one = (directory_ / "parent.vmsnap").string();
+    RKCommandResult saved = RKRunCommand({VMSNAP_BINARY, "-o", one, parent});
+    ASSERT_TRUE(saved.exitedWith(0)) << saved.standardError;
+    RKCommandResult live = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", parent});
+    RKCommandResult fromFile = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", one});
+    ASSERT_TRUE(fromFile.exitedWith(0)) << fromFile.standardError;
+    EXPECT_NE(fromFile.standardOutput.find("[" + parent + "] (vmsnap): 64-bit"), std::string::npos);
+    EXPECT_EQ(withoutVmsnapMarks(fromFile.standardOutput), live.standardOutput);
+
+    // Parent and child together: their shared memory (the memfd among it) in their pair's group.
+    const fs::path pair = directory_ / "pair";
+    saved = RKRunCommand({VMSNAP_BINARY, "-o", pair.string(), parent, child});
+    ASSERT_TRUE(saved.exitedWith(0)) << saved.standardError;
+    std::vector<std::string> files;
+    for (const auto& entry : fs::directory_iterator(pair)) files.push_back(entry.path().string());
+    ASSERT_EQ(files.size(), 2u);
+    live = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", "-v", parent, child});
+    std::vector<std::string> arguments = {MEMSPREAD_BINARY, "-f", "bytes", "-v"};
+    arguments.insert(arguments.end(), files.begin(), files.end());
+    fromFile = RKRunCommand(arguments);
+    ASSERT_TRUE(fromFile.exitedWith(0)) << fromFile.standardError;
+    EXPECT_EQ(withoutVmsnapMarks(fromFile.standardOutput), live.standardOutput);
+    EXPECT_NE(fromFile.standardOutput.find("memfd memspread-fixture"), std::string::npos);
+}
+
+TEST_F(RKVmsnapEndToEnd, BadFilesAndForbiddenProcessesEndInAMessageAndStatus1) {
+    const std::string good = R"({"format":"memspread-vmsnap","version":1,"pid":5,"processName":"p",)"
+                             R"("vmPageSize":4096,"processDescription":"Linux","regions":[]})";
+    const struct {
+        std::string name;
+        std::string contents;
+        std::string message;
+    } cases[] = {
+        {"text", "just some text\n", "vmsnap initialization failed: not valid JSON"},
+        {"truncated", good.substr(0, 40), "vmsnap initialization failed: not valid JSON"},
+        {"future", std::regex_replace(good, std::regex("\"version\":1"), "\"version\":9"),
+         "vmsnap initialization failed: unsupported version 9"},
+        {"foreign", std::regex_replace(good, std::regex("Linux"), "VAX"),
+         "Unable to determine platform from memory graph process description"},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.name);
+        std::string path = file(c.name, c.contents);
+        RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, path});
+        EXPECT_TRUE(run.exitedWith(1));
+        EXPECT_NE(run.standardError.find("Error opening vmsnap " + path + ": " + c.message), std::string::npos)
+            << run.standardError;
+        EXPECT_EQ(run.standardOutput.find("Memspread:"), std::string::npos);
+    }
+    RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, file("good", good)});
+    EXPECT_TRUE(run.exitedWith(0)) << run.standardError;
+    EXPECT_NE(run.standardOutput.find("p [5] (vmsnap): 64-bit"), std::string::npos);
+    // One measurement has one analysis mode: the breakdown's and the VM-object view's do not mix.
+    std::string breakdown = file("breakdown", std::regex_replace(good, std::regex("\"regions\""),
+                                                                 "\"showsPhysMemspread\":true,\"regions\""));
+    run = RKRunCommand({MEMSPREAD_BINARY, "--vmObjectDirty", breakdown});
+    EXPECT_TRUE(run.exitedWith(1));
+    EXPECT_NE(run.standardError.find("Vmsnap was gathered with an analysis mode that conflicts with other vmsnaps or "
+                                     "command line arguments: " + breakdown),
+              std::string::npos)
+        << run.standardError;
+    EXPECT_TRUE(RKRunCommand({MEMSPREAD_BINARY, "--vmObjectDirty", file("good", good)}).exitedWith(0));
+
+    if (geteuid() != 0) GTEST_SKIP() << "the rest needs another user";
+    std::string secret = file("secret", good);
+    ::chmod(secret.c_str(), 0600);
+    run = RKRunCommand(RKCommandAsNobody({secret}));
+    EXPECT_TRUE(run.exitedWith(1));
+    EXPECT_NE(run.standardError.find("Error opening vmsnap " + secret + ": Permission denied"), std::string::npos)
+        << run.standardError;
+    const std::string target = (directory_ / "init.vmsnap").string();
+    run = RKRunCommand(RKVmsnapCommandAsNobody({"-o", target, "1"}));
+    EXPECT_TRUE(run.exitedWith(1));
+    EXPECT_NE(run.standardError.find("Unable to analyze process with pid 1 (try as root?)"), std::string::npos)
+        << run.standardError;
+    EXPECT_FALSE(fs::exists(target));
+    run = RKRunCommand(RKVmsnapCommandAsNobody({"-a", "-o", directory_.string()}));
+    EXPECT_TRUE(run.exitedWith(1));
+    EXPECT_EQ(run.standardError, "vmsnap: -a needs root\n");
+}
+
+TEST_F(RKVmsnapEndToEnd, EveryProcessOfTheMachineSavedAndReported) {
+    if (geteuid() != 0) GTEST_SKIP() << "-a needs root";
+    const fs::path all = directory_ / "all";
+    RKCommandResult saved = RKRunCommand({VMSNAP_BINARY, "-a", "-o", all.string()});
+    ASSERT_TRUE(saved.exitedWith(0)) << saved.standardError;
+    std::vector<std::string> arguments = {MEMSPREAD_BINARY};
+    for (const auto& entry : fs::directory_iterator(all)) arguments.push_back(entry.path().string());
+    ASSERT_GT(arguments.size(), 2u);
+    RKCommandResult run = RKRunCommand(arguments);
+    ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
+    std::regex header(R"(^.* \[\d+\] \(vmsnap\): (32|64)-bit\tMemspread: )");
+    size_t headers = 0;
+    for (const std::string& line : RKSplitLines(run.standardOutput)) headers += std::regex_search(line, header);
+    EXPECT_EQ(headers, arguments.size() - 1) << "one report per saved process";
+}

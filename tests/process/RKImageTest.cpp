@@ -1,0 +1,106 @@
+// Images: the segment a name implies, the forward-only enumerator the walk names regions with,
+// the intern tables shared by gathering threads, and the images of a process on scripted
+// answers naming its regions.
+#include <gtest/gtest.h>
+
+#include <thread>
+
+#include "model/RKMemoryRegion.h"
+#include "platform/RKScriptedPlatform.h"
+#include "process/RKAnalysisSettings.h"
+#include "process/RKImage.h"
+#include "process/RKUserProcess.h"
+
+namespace {
+
+std::shared_ptr<RKImage> image(uint64_t start, uint64_t size, const char* name = "__DATA") {
+    auto result = std::make_shared<RKImage>();
+    result->start = start;
+    result->size = size;
+    result->setName(RKUnsharedString(name));
+    return result;
+}
+
+}  // namespace
+
+TEST(RKImage, NamePrefixDecidesTheSegment) {
+    const std::pair<const char*, uint8_t> cases[] = {
+        {"__TEXT", RKSegmentText},          {"__OBJC_RO", RKSegmentText}, {"__LINKEDIT", RKSegmentLinkedit},
+        {"__DATA_CONST", RKSegmentData},    {"__AUTH", RKSegmentData},    {".text", RKSegmentUnset},
+        {"unknown", RKSegmentUnset},
+    };
+    for (const auto& [name, segment] : cases) EXPECT_EQ(image(0, 1, name)->segment, segment) << name;
+    auto kept = image(0, 1, "__TEXT");
+    kept->setName(RKUnsharedString(".data"));  // not a "__" name: the segment stays
+    EXPECT_EQ(kept->segment, RKSegmentText);
+    EXPECT_EQ(kept->name(), ".data");
+}
+
+TEST(RKImage, EnumeratorOnlyMovesForwardAndSeesAppendedImages) {
+    RKImageList images{image(0x1000, 0x1000), image(0x3000, 0x2000)};
+    RKImageEnumerator enumerator(images);
+    EXPECT_EQ(enumerator.nextImageForStart(0x0, 0x800), nullptr);         // before the first
+    EXPECT_EQ(enumerator.nextImageForStart(0x1800, 0x2000), images[0]);   // start inside
+    EXPECT_EQ(enumerator.nextImageForStart(0x1c00, 0x1d00), images[0]);   // still there
+    EXPECT_EQ(enumerator.nextImageForStart(0x2000, 0x3000), nullptr);     // the gap: first passed
+    EXPECT_EQ(enumerator.nextImageForStart(0x2800, 0x3800), images[1]);   // end inside
+    EXPECT_EQ(enumerator.nextImageForStart(0x2000, 0x6000), images[1]);   // image inside the range
+    EXPECT_EQ(enumerator.nextImageForStart(0x5000, 0x6000), nullptr);     // never one that ended
+    images.push_back(image(0x7000, 0x1000));
+    EXPECT_EQ(enumerator.nextImageForStart(0x7000, 0x8000), images[2]);
+    EXPECT_EQ(enumerator.nextImageForStart(0x1000, 0x2000), nullptr) << "an image passed is not found again";
+}
+
+TEST(RKImage, InternTablesShareOneStringAcrossThreadsAndOverflowToOwnCopies) {
+    RKStringInternTable<4> table;
+    std::vector<RKSharedString> seen(8);
+    std::vector<std::thread> threads;
+    for (size_t i = 0; i < seen.size(); i++)
+        threads.emplace_back([&, i] { seen[i] = table.intern("/usr/lib/libsystem.dylib", 2, 4, 1024); });
+    for (auto& thread : threads) thread.join();
+    for (const auto& string : seen) EXPECT_EQ(string.get(), seen[0].get()) << "one object for equal strings";
+    EXPECT_EQ(table.filledCount(), 1u);
+    EXPECT_EQ(table.intern("b", 0, 4, 1024).get(), table.intern("b", 0, 4, 1024).get());
+    table.intern("c", 0, 4, 1024);
+    table.intern("d", 0, 4, 1024);
+    EXPECT_EQ(table.filledCount(), 4u);
+    auto overflow = table.intern("e", 0, 4, 1024);
+    EXPECT_EQ(*overflow, "e");
+    EXPECT_NE(overflow.get(), table.intern("e", 0, 4, 1024).get()) << "a full table hands out copies";
+    EXPECT_EQ(*table.intern("bx", 0, 4, 1), "b") << "compared on the first `limit` bytes only";
+    EXPECT_EQ(RKPathInternSlotForBase(0x180000000), (0x180000000 ^ 0x1800000 ^ 0x18000 ^ 0x180) % 2047);
+}
+
+TEST(RKImage, ImagesOfAProcessNameItsRegions) {
+    auto platform = std::make_shared<RKScriptedPlatform>();
+    RKScopedPlatform scoped(platform);
+    auto& tool = platform->addProcess(7, "tool");
+    RKRegionSubmapInfo file;
+    file.external_pager = 1;
+    for (uint64_t start : {0x10000, 0x12000, 0x14000, 0x20000})
+        tool.regions.push_back({start, 0x2000, file, RK_REGION_SUBMAP_INFO_COUNT, VM_PURGABLE_DENY, "/bin/tool", {}});
+    // Out of order, a header, a name with a space, and codes the platform sets itself.
+    tool.images = {
+        {"/bin/tool", 0x10000, 0x14000, 0x2000, ".data", RKSegmentData},
+        {"/bin/tool", 0x10000, 0x10000, 0x2000, "MACH_HEADER", 0},
+        {"/bin/tool", 0x10000, 0x12000, 0x2000, "__DATA_CONST extra words", 0},
+    };
+    auto process = std::dynamic_pointer_cast<RKUserProcess>(RKProcess::processWithPid(7));
+    ASSERT_TRUE(process);
+    process->gatherData();
+    const auto& regions = *process->memoryRegions();
+    ASSERT_EQ(regions.size(), 4u);
+    const std::tuple<const char*, uint8_t, const char*> expected[] = {
+        {"__TEXT", RKSegmentText, "/bin/tool"},
+        {"__DATA_CONST", RKSegmentData, "/bin/tool"},
+        {".data", RKSegmentData, "/bin/tool"},
+        {"mapped file", RKSegmentNoImage, "/bin/tool"},  // a mapping of no image segment
+    };
+    for (size_t i = 0; i < regions.size(); i++) {
+        EXPECT_EQ(regions[i]->name, std::get<0>(expected[i])) << i;
+        EXPECT_EQ(regions[i]->segment, std::get<1>(expected[i])) << i;
+        EXPECT_EQ(regions[i]->detailedName, std::get<2>(expected[i])) << i;
+    }
+    EXPECT_FALSE(process->images()) << "images are dropped after the walk";
+    RKAnalysisSettings::resetCache();
+}

@@ -1,0 +1,176 @@
+// Page dispositions of a live process on scripted kernel answers: chunking, sizing a region
+// from dispositions with the page it shares with its neighbours, subranges, and which regions
+// the walk reads page data for.
+#include <gtest/gtest.h>
+
+#include "model/RKMemoryRegion.h"
+#include "model/RKRangeList.h"
+#include "platform/RKScriptedPlatform.h"
+#include "process/RKAnalysisSettings.h"
+#include "process/RKUserProcess.h"
+
+namespace {
+
+constexpr uint64_t P = 4096;
+constexpr uint32_t kPresent = VM_PAGE_QUERY_PAGE_PRESENT;
+constexpr uint32_t kDirty = VM_PAGE_QUERY_PAGE_DIRTY;
+constexpr uint32_t kFile = VM_PAGE_QUERY_PAGE_EXTERNAL;
+constexpr uint32_t kPagedOut = VM_PAGE_QUERY_PAGE_PAGED_OUT;
+
+std::shared_ptr<RKMemoryRegion> regionOf(uint64_t start, uint64_t end) {
+    auto region = std::make_shared<RKMemoryRegion>();
+    region->start = start;
+    region->setEnd(end);
+    return region;
+}
+
+class RKUserProcessPagesTest : public ::testing::Test {
+protected:
+    RKUserProcessPagesTest() {
+        platform->addProcess(7, "tool");
+        platform->selfPid = 600;
+    }
+    void TearDown() override { RKAnalysisSettings::resetCache(); }
+
+    RKScriptedProcess& tool() { return *platform->find(7); }
+    std::shared_ptr<RKUserProcess> process(bool gather = false, bool breakDown = true) {
+        platform->selfRegionValue = breakDown ? 1 : 0;
+        RKAnalysisSettings::resetCache();
+        testing::internal::CaptureStderr();
+        auto made = std::dynamic_pointer_cast<RKUserProcess>(RKProcess::processWithPid(7));
+        if (made && gather) made->gatherData();
+        printed = testing::internal::GetCapturedStderr();
+        return made;
+    }
+    void script(uint64_t address, std::initializer_list<uint32_t> dispositions) {
+        for (uint32_t d : dispositions) tool().dispositions[address] = d, address += P;
+    }
+
+    std::shared_ptr<RKScriptedPlatform> platform = std::make_shared<RKScriptedPlatform>();
+    RKScopedPlatform scope{platform};
+    std::string printed;
+};
+
+TEST_F(RKUserProcessPagesTest, ChunksOf4096Pages) {
+    auto tool = process();
+    for (uint64_t pages : {0ull, 4096ull, 4097ull}) {
+        std::vector<std::array<uint64_t, 3>> chunks;
+        EXPECT_TRUE(tool->_enumerateDispositionChunks(0x100000, pages, [&](const uint32_t*, uint64_t n, uint64_t i, uint64_t of) {
+            chunks.push_back({n, i, of});
+        }));
+        std::vector<std::array<uint64_t, 3>> expected;
+        if (pages == 4096) expected = {{4096, 0, 1}};
+        if (pages == 4097) expected = {{4096, 0, 2}, {1, 1, 2}};
+        EXPECT_EQ(chunks, expected) << pages;
+    }
+}
+
+TEST_F(RKUserProcessPagesTest, PartialPagesAreChargedTheirBytesAndQueriedOnce) {
+    script(0x1000, {kPresent, kPresent | kFile, kPresent | kFile | kDirty, kPagedOut, kPresent});
+    script(0x6000, {kPresent});
+    auto tool = process();
+    auto region = regionOf(0x1800, 0x5800);
+    EXPECT_TRUE(tool->_populateMemoryRegionWithPageQueries(*region, {}));
+    // Page 0x1000 anonymous (0x800 of it here), a clean file page (nothing), a dirty file page,
+    // one swapped, and 0x800 of the anonymous page 0x5000.
+    EXPECT_EQ(region->dirtySize, 0x800 + P + 0x800);
+    EXPECT_EQ(region->swappedSize, P);
+    EXPECT_EQ(platform->callCount("pageRangeQuery"), 1u);
+
+    auto next = regionOf(0x5800, 0x7000);
+    EXPECT_TRUE(tool->_populateMemoryRegionWithPageQueries(*next, {}));
+    EXPECT_EQ(next->dirtySize, 0x800 + P) << "page 0x5000 from the cache, page 0x6000 queried";
+    EXPECT_EQ(platform->callCount("pageRangeQuery"), 2u);
+}
+
+TEST_F(RKUserProcessPagesTest, UnusedSharedCacheRegionTakesItsPartOfTheCommonPage) {
+    script(0x10000, {kPresent | kFile | kDirty, kPresent | kFile | kDirty});
+    auto tool = process();
+    auto unused = regionOf(0xE000, 0x10800);
+    unused->unusedSharedCacheRegion = true;
+    EXPECT_TRUE(tool->_populateMemoryRegionWithPageQueries(*unused, {}));
+    EXPECT_EQ(platform->callCount("pageRangeQuery"), 0u) << "an unused region is never queried";
+    EXPECT_EQ(unused->dirtySize, 0u);
+
+    auto image = regionOf(0x10800, 0x12000);
+    EXPECT_TRUE(tool->_populateMemoryRegionWithPageQueries(*image, {}));
+    EXPECT_EQ(image->dirtySize, 0x800 + P);
+    EXPECT_EQ(unused->dirtySize, 0x800u) << "its bytes of page 0x10000";
+}
+
+TEST_F(RKUserProcessPagesTest, SubrangesAreRunsOfLikePagesInObjectOffsets) {
+    script(0x10000, {kPresent | kDirty, kPresent | kDirty, 0, kPresent});
+    auto tool = process();
+    auto region = regionOf(0x10000, 0x14000);
+    region->offset = 0x100000;
+    tool->_addSubrangesForRegion(*region, VM_PURGABLE_DENY);
+    ASSERT_TRUE(region->subrangeList());
+    EXPECT_EQ(region->subrangeList()->nodes(), (std::vector<RKRangeListNode>{
+                                                   {0x100000, 2 * P, 0, 2 * P, 0, 0, 0},
+                                                   {0x100000 + 3 * P, P, P, 0, 0, 0, 0},
+                                               }));
+
+    // Wired regions are wired in every run; a volatile region's present pages are reclaimable.
+    auto wired = regionOf(0x10000, 0x14000);
+    wired->wired = true;
+    tool->_addSubrangesForRegion(*wired, VM_PURGABLE_VOLATILE);
+    RKMemoryTotal sum = wired->subrangeList()->sum();
+    EXPECT_EQ(sum.dirty, 2 * P);
+    EXPECT_EQ(sum.reclaimable, P);
+    EXPECT_EQ(sum.wired, 3 * P);
+}
+
+TEST_F(RKUserProcessPagesTest, ProcessThatExitedBeforeItsPageQuery) {
+    tool().pageQueryResult = KERN_INVALID_ARGUMENT;
+    tool().shortStatusErrno = ESRCH;
+    auto tool = process();
+    auto region = regionOf(0x10000, 0x14000);
+    testing::internal::CaptureStderr();
+    EXPECT_FALSE(tool->_populateMemoryRegionWithPageQueries(*region, {}));
+    tool->_addSubrangesForRegion(*region, VM_PURGABLE_DENY);
+    EXPECT_EQ(testing::internal::GetCapturedStderr(),
+              "mach_vm_page_range_query: process is gone\nmach_vm_page_range_query: process is gone\n");
+    EXPECT_EQ(tool->warnings().front(), "tool [7]: process is gone (process exited)");
+    EXPECT_FALSE(region->subrangeList()) << "a region only partly read keeps its counters";
+}
+
+// The walk reads page data once, after it, for the regions worth splitting only; file
+// mappings only where dirty file pages can be told from clean ones.
+TEST_F(RKUserProcessPagesTest, PageDataIsReadOnceForEligibleRegions) {
+    auto entry = [](uint64_t start, uint8_t shareMode, uint32_t resident, uint32_t dirtied, bool file) {
+        RKScriptedRegion region;
+        region.start = start;
+        region.size = 4 * P;
+        region.info.share_mode = shareMode;
+        region.info.pages_resident = resident;
+        region.info.pages_dirtied = dirtied;
+        region.info.external_pager = file ? 1 : 0;
+        region.info.object_id_full = start;
+        return region;
+    };
+    tool().regions = {entry(0x10000, SM_SHARED, 2, 2, false), entry(0x20000, SM_PRIVATE, 2, 2, false),
+                      entry(0x30000, SM_SHARED, 4, 4, false), entry(0x40000, SM_SHARED, 3, 1, true)};
+    script(0x10000, {kPresent, kPresent});
+    script(0x40000, {kPresent | kFile | kDirty, kPresent | kFile, kPresent | kFile});
+    auto gathered = process(true);
+    ASSERT_EQ(tool().preparedRanges.size(), 2u) << "read once, then released";
+    EXPECT_TRUE(tool().preparedRanges[1].empty());
+    const auto& ranges = tool().preparedRanges[0];
+    ASSERT_EQ(ranges.size(), 2u) << "not the private one, nor the one all dirty";
+    EXPECT_EQ(ranges[0].start, 0x10000u);
+    EXPECT_EQ(ranges[1].start, 0x40000u);
+    EXPECT_TRUE(ranges[1].fileBacked);
+    EXPECT_EQ((*gathered->memoryRegions())[3]->subrangeList()->sum().dirty, P);
+
+    platform->pageAbilities.dirtyFilePages = false;
+    tool().preparedRanges.clear();
+    gathered = process(true);
+    EXPECT_EQ(tool().preparedRanges[0].size(), 1u) << "the file mapping keeps its counters";
+    EXPECT_FALSE((*gathered->memoryRegions())[3]->subrangeList());
+
+    tool().preparedRanges.clear();
+    process(true, false);
+    EXPECT_TRUE(tool().preparedRanges.empty()) << "no subranges without the breakdown";
+}
+
+}  // namespace

@@ -1,0 +1,176 @@
+// Snapshots: the file format in both directions (and every kind of damage ending in an error),
+// and the snapshot process built from hand-made files: platform, translation, images from typed
+// regions, figures from the file and the details a Linux snapshot carries.
+#include <gtest/gtest.h>
+
+#include "model/RKMemoryRegion.h"
+#include "model/RKRangeList.h"
+#include "platform/RKScriptedPlatform.h"
+#include "process/RKVmsnapCompression.h"
+#include "process/RKVmsnapProcess.h"
+
+namespace {
+
+// A snapshot document around `regions` (a JSON array) with `extra` members.
+std::string snapshot(const std::string& description, const std::string& regions = "[]",
+                     const std::string& extra = "") {
+    return R"({"format":"memspread-vmsnap","version":1,"pid":42,"processName":"tool","vmPageSize":4096,)"
+           R"("processDescription":")" + description + R"(","regions":)" + regions + extra + "}";
+}
+
+struct Opened {
+    std::shared_ptr<RKVmsnapProcess> process;
+    RKError error;
+    std::string printed;
+};
+
+Opened open(const std::string& bytes) {
+    Opened result{std::make_shared<RKVmsnapProcess>(), {}, {}};
+    testing::internal::CaptureStderr();
+    if (!result.process->initWithVmsnapData(bytes, &result.error)) result.process.reset();
+    result.printed = testing::internal::GetCapturedStderr();
+    return result;
+}
+
+class RKVmsnapTest : public ::testing::Test {
+protected:
+    std::shared_ptr<RKScriptedPlatform> platform = std::make_shared<RKScriptedPlatform>();
+    RKScopedPlatform scoped{platform};
+};
+
+}  // namespace
+
+TEST_F(RKVmsnapTest, GraphSurvivesTheFileCompressedAndEveryDamageIsAnError) {
+    RKVmsnapGraph graph;
+    graph.pid = 7;
+    graph.processName = "name with \"quotes\"";
+    graph.processDescriptionString = "Linux x86_64";
+    graph.vmPageSize = 4096;
+    graph.physicalMemspread = 1 << 20;
+    graph.showsPhysMemspread = true;
+    RKVmsnapRegion region;
+    region.address = 0x1000;
+    region.length = 0x3000;
+    region.object_id = 0x8000000000000001ull;  // past the signed range
+    region.details = RKVmsnapRegionDetails{"heap", "", 0x2000, 0, 0x1000, 0, true, false, {{0, 0x2000, 0x2000, 0, 0, 0, 0x2000}}};
+    graph.regions = {region};
+    graph.unaddressedRegions = {{0x5000, 0, 0xFFFFFFFFFFFFFFFFull, 2, 0, {"page table", "", 0x5000, 0, 0, 0, false, false, {}}}};
+    const std::string bytes = RKVmsnapSerialize(graph);
+    ASSERT_TRUE(RKVmsnapIsCompressed(bytes));
+    RKError error;
+    auto back = RKVmsnapParse(bytes, &error);
+    ASSERT_TRUE(back) << error.localizedDescription.value_or("");
+    EXPECT_EQ(back->processName, graph.processName);
+    EXPECT_EQ(back->regions[0].object_id, region.object_id);
+    EXPECT_EQ(back->regions[0].details->subranges[0].wired, 0x2000u);
+    EXPECT_EQ(back->unaddressedRegions[0].details.name, "page table");
+
+    const std::string plain = snapshot("Linux");
+    const std::pair<std::string, std::string> damaged[] = {
+        {"", "not valid JSON"},
+        {plain.substr(0, plain.size() - 5), "not valid JSON"},
+        {bytes.substr(0, bytes.size() / 2), "truncated compressed data"},
+        {bytes.substr(0, 4) + std::string(40, 'x'), "damaged compressed data"},
+        {bytes + bytes, "data after the end"},
+        {"[1,2]", "not a vmsnap"},
+        {R"({"format":"other"})", "not a memspread vmsnap"},
+        {snapshot("Linux", "[]", R"(,"version":2)").replace(0, 1, "{\"version\":2,"), "unsupported version 2"},
+        {snapshot("Linux", R"([{"address":4096,"length":"big"}])"), "region 0 \"length\" is not an unsigned integer"},
+        {snapshot("Linux", R"([{"address":8192,"length":4096},{"address":4096,"length":4096}])"), "region 1 overlaps"},
+        {snapshot("Linux", R"([{"address":18446744073709547520,"length":8192}])"), "wraps around"},
+        {snapshot("Linux", R"([{"address":4096,"length":4096,"details":{"subranges":[[1,2]]}}])"), "subrange 0 is not an array of 7"},
+        {snapshot("Linux").replace(snapshot("Linux").find("4096"), 4, "3000"), "\"vmPageSize\" is not a page size"},
+    };
+    for (const auto& [input, reason] : damaged) {
+        RKError failure;
+        EXPECT_FALSE(RKVmsnapParse(input, &failure)) << reason;
+        EXPECT_EQ(failure.domain, "MemspreadErrorDomain");
+        EXPECT_EQ(failure.code, 1);
+        EXPECT_NE(failure.localizedDescription.value_or("").find(reason), std::string::npos)
+            << failure.localizedDescription.value_or("");
+    }
+}
+
+TEST_F(RKVmsnapTest, DescriptionChoosesThePlatformAndTranslation) {
+    const struct {
+        std::string description;
+        std::string images;
+        uint64_t base;
+        bool translated;
+    } cases[] = {
+        {"Linux x86_64 6.18", "", 0, false},
+        {"macOS X86-64 (X86 compatible) (translated)", "", 0x7FFF00000000, true},
+        {"X86", "", 0x90000000, false},
+        {"ARM64_32 watch", "", 0x1A000000, false},
+        {"ARM64", "", 0x180000000, false},
+        {"ARM", "libfoo (arm64_32)", 0x1A000000, false},
+        {"ARM", "libfoo (armv7k)", 0x40000000, false},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.description);
+        Opened opened = open(snapshot(c.description, "[]", R"(,"binaryImagesDescription":")" + c.images + "\""));
+        ASSERT_TRUE(opened.process);
+        EXPECT_EQ(opened.process->sharedRegionBase(), c.base);
+        EXPECT_EQ(opened.process->isTranslated(), c.translated);
+        EXPECT_EQ(opened.process->displayString(), "tool [42] (vmsnap)");
+    }
+    Opened unknown = open(snapshot("PowerPC"));
+    EXPECT_FALSE(unknown.process);
+    EXPECT_EQ(unknown.error.code, 2);
+    EXPECT_EQ(unknown.error.localizedDescription, "Unable to determine platform from memory graph process description");
+    EXPECT_EQ(unknown.printed, "Unable to determine platform architecture of target\n");
+}
+
+TEST_F(RKVmsnapTest, TypedRegionsBecomeImagesAndFiguresComeFromTheFile) {
+    // Two segments of one file with an untyped region between them, then a file region with a
+    // reserved area's name, all below the x86-64 shared region.
+    const std::string regions = R"J([
+        {"address":4096,"length":8192,"type":"__TEXT","path":"/bin/tool","external_pager":true,"resident_size":8192},
+        {"address":12288,"length":4096,"type":"gap","user_tag":1,"resident_size":4096,"dirty_size":4096},
+        {"address":16384,"length":4096,"type":"__DATA","path":"/bin/tool","external_pager":true,
+         "resident_size":4096,"dirty_size":4096},
+        {"address":20480,"length":4096,"type":"commpage (reserved)"}])J";
+    Opened opened = open(snapshot("X86-64", regions,
+                                  R"(,"physicalMemspread":123,"physicalMemspreadPeak":456,"showsPhysMemspread":true)"));
+    ASSERT_TRUE(opened.process);
+    opened.process->gatherData();
+    const auto& list = *opened.process->memoryRegions();
+    ASSERT_EQ(list.size(), 4u) << "no page-table or owned-object region";
+    EXPECT_EQ(list[0]->name, "__TEXT");
+    EXPECT_EQ(list[0]->segment, RKSegmentText);
+    EXPECT_EQ(list[0]->detailedName, "/bin/tool");
+    EXPECT_EQ(list[0]->cleanNonSpecSize, 8192u);
+    EXPECT_EQ(list[1]->name, "heap") << "named by its tag: a type that is no segment name makes no image";
+    EXPECT_EQ(list[1]->dirtySize, 4096u);
+    EXPECT_EQ(list[2]->name, "__DATA");
+    EXPECT_EQ(list[2]->segment, RKSegmentData);
+    EXPECT_EQ(list[3]->name, "commpage (reserved)");
+    EXPECT_TRUE(list[3]->verbose);
+    EXPECT_EQ(opened.process->phys_memspread(), 123u);
+    EXPECT_EQ(opened.process->phys_memspread_peak(), 456u);
+    EXPECT_TRUE(opened.process->breakDownPhysMemspread());
+    EXPECT_EQ(platform->callCount("regionRecurse") + platform->callCount("pageRangeQuery"), 0u);
+}
+
+TEST_F(RKVmsnapTest, LinuxDetailsRestoreTheRegionsTheLiveRunBuilt) {
+    const std::string regions = R"([
+        {"address":4096,"length":16384,"user_tag":41,"share_mode":4,"object_id":99,"resident_size":8192,"dirty_size":8192,
+         "details":{"name":"memfd","detail":"cache","dirty":8192,"clean":0,"wired":true,
+                    "subranges":[[0,4096,4096,0,0,0,4096],[8192,4096,4096,0,0,0,4096]]}}])";
+    const std::string unaddressed = R"(,"unaddressedRegions":[{"size":8192,"object_id":18446744073709551615,
+        "share_mode":2,"details":{"name":"page table","dirty":8192}}])";
+    Opened opened = open(snapshot("Linux x86_64", regions, unaddressed));
+    ASSERT_TRUE(opened.process);
+    opened.process->gatherData();
+    const auto& list = *opened.process->memoryRegions();
+    ASSERT_EQ(list.size(), 2u);
+    EXPECT_EQ(list[0]->fullName(), "memfd cache");
+    EXPECT_TRUE(list[0]->wired);
+    ASSERT_TRUE(list[0]->subrangeList());
+    EXPECT_EQ(list[0]->subrangeList()->nodeCount(), 2u);
+    EXPECT_EQ(list[0]->subrangeList()->sum().dirty, 8192u);
+    EXPECT_EQ(list[1]->start, RKRegionNoAddress);
+    EXPECT_EQ(list[1]->name, "page table");
+    EXPECT_EQ(list[1]->dirtySize, 8192u);
+    EXPECT_EQ(list[1]->object_id, 0xFFFFFFFFFFFFFFFFull);
+}
