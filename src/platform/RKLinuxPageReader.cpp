@@ -82,7 +82,10 @@ public:
         : pagemap_(pagemap), pageSize_(pageSize), probe_(probe) {}
 
     kern_return_t readRange(const RKPageQueryRange& range, uint64_t firstPage, std::span<uint32_t> out) {
-        if (probe_.pagemapScan && !probe_.kpageflags) return scanRange(range, out);
+        // PAGEMAP_SCAN skips holes and tells the zero page; frames are worth reading only where
+        // a page's flags change its disposition (dirty file pages, lazily freed ones).
+        const bool needFlags = probe_.kpageflags && (range.fileBacked || range.reusablePages > 0);
+        if (probe_.pagemapScan && !needFlags) return scanRange(range, out);
         std::vector<uint64_t>& entries = entries_;
         const uint64_t startPage = range.start / pageSize_;
         for (uint64_t done = 0; done < out.size(); done += kChunkPages) {
@@ -91,7 +94,7 @@ public:
             if (!preadAll(pagemap_, entries.data(), count * 8, (startPage + done) * 8)) return KERN_INVALID_ARGUMENT;
             for (uint64_t i = 0; i < count; i++) {
                 out[done + i] = RKDispositionForPagemapEntry(entries[i], range.fileBacked, std::nullopt);
-                if (probe_.kpageflags && RKPagemapEntryNeedsFlags(entries[i], range.fileBacked))
+                if (needFlags && RKPagemapEntryNeedsFlags(entries[i], range.fileBacked))
                     lookups_.push_back({entries[i] & RKPagemapFrameMask, firstPage + done + i, range.fileBacked, entries[i]});
             }
         }
@@ -121,8 +124,10 @@ public:
 
 private:
     kern_return_t scanRange(const RKPageQueryRange& range, std::span<uint32_t> out) {
-        std::vector<RKPageScanRun> runs;
-        std::vector<RKPageScanRun> buffer(kScanRunsPerCall);
+        std::vector<RKPageScanRun>& runs = runs_;
+        std::vector<RKPageScanRun>& buffer = scanBuffer_;
+        runs.clear();
+        buffer.resize(kScanRunsPerCall);
         const uint64_t end = range.start + out.size() * pageSize_;
         for (uint64_t start = range.start; start < end;) {
             RKPmScanArg arg{sizeof(RKPmScanArg), 0, start, end, 0, reinterpret_cast<uintptr_t>(buffer.data()),
@@ -146,6 +151,8 @@ private:
     const RKLinuxPageProbe& probe_;
     std::vector<uint64_t> entries_;
     std::vector<FlagLookup> lookups_;
+    std::vector<RKPageScanRun> runs_;
+    std::vector<RKPageScanRun> scanBuffer_;
 };
 
 }  // namespace
