@@ -43,6 +43,7 @@ kern_return_t readCandidates(int pagemap, uint64_t pageSize, const std::vector<R
             entries.resize(std::min(kChunkPages, count - done));
             if (!preadAll(pagemap, entries.data(), entries.size() * 8, (first + done) * 8)) return KERN_INVALID_ARGUMENT;
             for (uint64_t entry : entries) {
+                if (ranges[r].fileBacked && (entry & RKPagemapFilePage)) continue;  // page cache, not a copy
                 if ((entry & RKPagemapPresent) && (entry & RKPagemapFrameMask) != 0)
                     pages.push_back({entry & RKPagemapFrameMask, r, 0});
                 else if (!(entry & RKPagemapPresent) && (entry & RKPagemapSwapped))

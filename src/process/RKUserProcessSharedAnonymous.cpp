@@ -15,12 +15,15 @@ bool isAnonymousTag(uint32_t tag) { return tag == RKTagAnonymous || tag == RKTag
 
 bool RKUserProcess::_noteSharedAnonymousRegion(const std::shared_ptr<RKMemoryRegion>& region,
                                                const RKRegionSubmapInfo& info, RKRegionWalkState& state) {
-    // Copy-on-write share mode on private anonymous memory: smaps shows shared pages.
     if (state.hidden || state.sharingAnalysisDisabled || !_isAlive() || info.share_mode != SM_COW ||
-        info.external_pager != 0 || !isAnonymousTag(info.user_tag) || region->start == RKRegionNoAddress)
+        region->start == RKRegionNoAddress)
         return false;
+    // Copy-on-write share mode on private anonymous memory: smaps shows shared pages. A private
+    // file mapping's copied pages (relocated data) are inherited across fork the same way.
+    const bool file = info.external_pager != 0;
+    if (file ? region->dirtySize == 0 : !isAnonymousTag(info.user_tag)) return false;
     state.sharedAnonymousRegions.push_back(region);
-    state.sharedAnonymousRanges.push_back(RKPageQueryRange{region->start, region->size, false, 0});
+    state.sharedAnonymousRanges.push_back(RKPageQueryRange{region->start, region->size, file, 0});
     return RKPlatform::current().pageQueryAbilities().frames;
 }
 
