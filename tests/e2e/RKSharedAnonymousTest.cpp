@@ -17,8 +17,14 @@ namespace {
 
 const uint64_t P = static_cast<uint64_t>(sysconf(_SC_PAGESIZE));
 
+// A "Field: N kB" line of a /proc file, in bytes; with no field, the file's first number.
 uint64_t statusField(pid_t pid, const std::string& file, const std::string& field) {
     std::ifstream in("/proc/" + std::to_string(pid) + "/" + file);
+    if (field.empty()) {
+        uint64_t value = 0;
+        in >> value;
+        return value;
+    }
     std::string line;
     while (std::getline(in, line))
         if (line.rfind(field + ":", 0) == 0) return std::stoull(line.substr(field.size() + 1)) * 1024;
@@ -83,6 +89,53 @@ TEST(RKSharedAnonymous, ForkedWorkersShareTheirParentsMemoryOnce) {
     auto own = dirtyByCategory(report, report.find("[" + std::to_string(fixture.childPid()) + "]: 64-bit"));
     EXPECT_GE(own["anonymous"], P);
     EXPECT_GE(own["heap"], P);
+}
+
+// Sets a KSM knob for the test's duration and puts the old value back.
+class KsmSetting {
+public:
+    KsmSetting(const std::string& name, const std::string& value) : path_("/sys/kernel/mm/ksm/" + name) {
+        std::ifstream(path_) >> old_;
+        ok_ = static_cast<bool>(std::ofstream(path_) << value << std::flush);
+    }
+    ~KsmSetting() { std::ofstream(path_) << old_; }
+    bool ok() const { return ok_; }
+
+private:
+    std::string path_, old_;
+    bool ok_ = false;
+};
+
+TEST(RKSharedAnonymous, PagesMergedByKsmAreSharedByTheirPair) {
+    if (geteuid() != 0 || access("/sys/kernel/mm/ksm/run", W_OK) != 0) GTEST_SKIP() << "needs root and KSM";
+    KsmSetting scan("pages_to_scan", "10000"), sleep("sleep_millisecs", "10"), run("run", "1");
+    ASSERT_TRUE(run.ok());
+    RKFixtureProcess fixture;
+    ASSERT_TRUE(fixture.start(MEMSPREAD_FORKTREE_FIXTURE, {"--ksm"})) << fixture.error();
+    const pid_t second = fixture.childPid();
+    // Merging takes a few scans of the mergeable areas.
+    for (int i = 0; i < 500 && statusField(second, "ksm_merging_pages", "") == 0; i++) usleep(20000);
+    std::ifstream merging("/proc/" + std::to_string(second) + "/ksm_merging_pages");
+    uint64_t merged = 0;
+    merging >> merged;
+    if (merged < 64) GTEST_SKIP() << "KSM merged " << merged << " pages in time";
+
+    RKCommandResult result = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", "-t", std::to_string(fixture.pid())});
+    ASSERT_TRUE(result.exitedWith(0)) << result.standardError;
+    const std::string& report = result.standardOutput;
+    // The sibling is the one other process in a block of the second child: their pair's group.
+    const size_t section = report.find("[" + std::to_string(second) + "]: 64-bit");
+    static const std::regex pairHeading(R"(^Shared with [^,\n]+ \[\d+\]:$)");
+    size_t pair = std::string::npos;
+    for (size_t at = report.find("Shared with ", section); at != std::string::npos && pair == std::string::npos;
+         at = report.find("Shared with ", at + 1)) {
+        if (report.find("Auxiliary data:", section) < at) break;  // past the child's section
+        if (std::regex_match(report.substr(at, report.find('\n', at) - at), pairHeading)) pair = at;
+    }
+    ASSERT_NE(pair, std::string::npos) << report;
+    // The merged pages, and any page the parent copied after forking both (then still shared
+    // by the two alone).
+    EXPECT_GE(dirtyByCategory(report, pair)["anonymous"], 64 * P) << report;
 }
 
 }  // namespace
