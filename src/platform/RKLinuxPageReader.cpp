@@ -29,21 +29,6 @@ kern_return_t failureFor(int error) {
     return error == EACCES || error == EPERM ? KERN_PROTECTION_FAILURE : KERN_INVALID_ARGUMENT;
 }
 
-// pread of exactly `bytes`, looping on short reads; a read that ends early means the process
-// (or, for kpageflags, the frame range) is gone.
-bool preadAll(int fd, void* buffer, size_t bytes, uint64_t offset) {
-    auto* p = static_cast<char*>(buffer);
-    while (bytes > 0) {
-        ssize_t n = ::pread(fd, p, bytes, static_cast<off_t>(offset));
-        if (n < 0 && errno == EINTR) continue;
-        if (n <= 0) return false;
-        p += n;
-        bytes -= static_cast<size_t>(n);
-        offset += static_cast<uint64_t>(n);
-    }
-    return true;
-}
-
 RKLinuxPageProbe probe(const std::string& procRoot) {
     RKLinuxPageProbe result;
     RKUniqueFd pagemap(::open((procRoot + "/self/pagemap").c_str(), O_RDONLY | O_CLOEXEC));
@@ -57,14 +42,14 @@ RKLinuxPageProbe probe(const std::string& procRoot) {
                     RKPageIsPresent, RKPageIsPresent};
     result.pagemapScan = ::ioctl(pagemap.get(), kPagemapScan, &arg) >= 0;
     uint64_t entry = 0;
-    if (!preadAll(pagemap.get(), &entry, sizeof entry, address / page * 8)) return result;
+    if (!RKPreadAll(pagemap.get(), &entry, sizeof entry, address / page * 8)) return result;
     const uint64_t frame = entry & RKPagemapFrameMask;
     // Root in a user namespace, or without CAP_SYS_ADMIN, reads frame 0 for every page.
     result.frames = (entry & RKPagemapPresent) && frame != 0;
     if (!result.frames) return result;
     RKUniqueFd flags(::open((procRoot + "/kpageflags").c_str(), O_RDONLY | O_CLOEXEC));
     uint64_t word = 0;
-    result.kpageflags = flags.valid() && preadAll(flags.get(), &word, sizeof word, frame * 8);
+    result.kpageflags = flags.valid() && RKPreadAll(flags.get(), &word, sizeof word, frame * 8);
     return result;
 }
 
@@ -91,7 +76,7 @@ public:
         for (uint64_t done = 0; done < out.size(); done += kChunkPages) {
             uint64_t count = std::min<uint64_t>(kChunkPages, out.size() - done);
             entries.resize(count);
-            if (!preadAll(pagemap_, entries.data(), count * 8, (startPage + done) * 8)) return KERN_INVALID_ARGUMENT;
+            if (!RKPreadAll(pagemap_, entries.data(), count * 8, (startPage + done) * 8)) return KERN_INVALID_ARGUMENT;
             for (uint64_t i = 0; i < count; i++) {
                 out[done + i] = RKDispositionForPagemapEntry(entries[i], range.fileBacked, std::nullopt);
                 if (needFlags && RKPagemapEntryNeedsFlags(entries[i], range.fileBacked))
@@ -111,7 +96,7 @@ public:
         size_t next = 0;
         for (const RKFrameRun& run : RKCoalesceFrames(frames, kFlagsPerRead)) {
             words.resize(run.count);
-            bool read = preadAll(kpageflags, words.data(), run.count * 8, run.first * 8);
+            bool read = RKPreadAll(kpageflags, words.data(), run.count * 8, run.first * 8);
             for (; next < lookups_.size() && lookups_[next].frame < run.first + run.count; next++) {
                 const FlagLookup& lookup = lookups_[next];
                 // A frame past the end of memory leaves the page as pagemap alone says.
@@ -156,6 +141,19 @@ private:
 };
 
 }  // namespace
+
+bool RKPreadAll(int fd, void* buffer, size_t bytes, uint64_t offset) {
+    auto* p = static_cast<char*>(buffer);
+    while (bytes > 0) {
+        ssize_t n = ::pread(fd, p, bytes, static_cast<off_t>(offset));
+        if (n < 0 && errno == EINTR) continue;
+        if (n <= 0) return false;
+        p += n;
+        bytes -= static_cast<size_t>(n);
+        offset += static_cast<uint64_t>(n);
+    }
+    return true;
+}
 
 const RKLinuxPageProbe& RKProbePageReading(const std::string& procRoot) {
     static std::mutex mutex;

@@ -19,19 +19,6 @@ namespace {
 constexpr uint64_t kChunkPages = 4096;
 constexpr uint64_t kFramesPerRead = 4096;
 
-bool preadAll(int fd, void* buffer, size_t bytes, uint64_t offset) {
-    auto* p = static_cast<char*>(buffer);
-    while (bytes > 0) {
-        ssize_t n = ::pread(fd, p, bytes, static_cast<off_t>(offset));
-        if (n < 0 && errno == EINTR) continue;
-        if (n <= 0) return false;
-        p += n;
-        bytes -= static_cast<size_t>(n);
-        offset += static_cast<uint64_t>(n);
-    }
-    return true;
-}
-
 // Every present page (by frame) and swapped page (by swap entry) of the ranges.
 kern_return_t readCandidates(int pagemap, uint64_t pageSize, const std::vector<RKPageQueryRange>& ranges,
                              std::vector<RKSharedAnonymousPage>& pages) {
@@ -41,7 +28,7 @@ kern_return_t readCandidates(int pagemap, uint64_t pageSize, const std::vector<R
         const uint64_t count = (ranges[r].start % pageSize + ranges[r].size + pageSize - 1) / pageSize;
         for (uint64_t done = 0; done < count; done += kChunkPages) {
             entries.resize(std::min(kChunkPages, count - done));
-            if (!preadAll(pagemap, entries.data(), entries.size() * 8, (first + done) * 8)) return KERN_INVALID_ARGUMENT;
+            if (!RKPreadAll(pagemap, entries.data(), entries.size() * 8, (first + done) * 8)) return KERN_INVALID_ARGUMENT;
             for (uint64_t entry : entries) {
                 if (ranges[r].fileBacked && (entry & RKPagemapFilePage)) continue;  // page cache, not a copy
                 if ((entry & RKPagemapPresent) && (entry & RKPagemapFrameMask) != 0)
@@ -76,8 +63,8 @@ void keepShared(int kpagecount, int kpageflags, std::vector<RKSharedAnonymousPag
         const uint64_t length = last - first + 1;
         counts.resize(length);
         flags.resize(length);
-        const bool read = preadAll(kpagecount, counts.data(), length * 8, first * 8) &&
-                          preadAll(kpageflags, flags.data(), length * 8, first * 8);
+        const bool read = RKPreadAll(kpagecount, counts.data(), length * 8, first * 8) &&
+                          RKPreadAll(kpageflags, flags.data(), length * 8, first * 8);
         for (; i < j; i++) {
             const uint64_t at = pages[i].page - first;
             if (read && counts[at] > 1 && !(flags[at] & RKKpfZeroPage)) pages[kept++] = pages[i];

@@ -17,6 +17,7 @@
 #include "process/RKAnalysisSettings.h"
 #include "process/RKUserProcess.h"
 #include "support/RKFixtureProcess.h"
+#include "support/RKReportRows.h"
 #include "support/RKRunCommand.h"
 #include "support/RKUnprivileged.h"
 
@@ -24,17 +25,6 @@ namespace {
 
 const uint64_t P = static_cast<uint64_t>(sysconf(_SC_PAGESIZE));
 const uint64_t MiB = 1 << 20;
-
-// The Dirty column by category of the table after the first `heading` at or after `from`.
-std::map<std::string, uint64_t> dirtyByCategory(const std::string& report, const std::string& heading, size_t from = 0) {
-    static const std::regex row(R"(^ *(\d+) B +\d+ B +\d+ B +\d+    (.+)$)");
-    std::map<std::string, uint64_t> rows;
-    for (const std::string& line : RKSplitLines(report.substr(std::min(report.find(heading, from), report.size())))) {
-        std::smatch match;
-        if (!rows.count("TOTAL") && std::regex_match(line, match, row)) rows[match[2]] = std::stoull(match[1]);
-    }
-    return rows;
-}
 
 // A "Name: N kB" field, in bytes, of the smaps entry at `address` (or of a status-like file).
 uint64_t kernelField(const std::string& file, const std::string& field, uint64_t address = 0) {
@@ -91,15 +81,15 @@ TEST(RKPageLevel, HalvesWrittenByParentAndChildCountOnceEach) {
     ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
     const std::string& report = run.standardOutput;
     // memfd_halves whole (16 MiB) and the touched half of memfd_half.
-    EXPECT_EQ(dirtyByCategory(report, "Summary Memspread: ")["memfd"], 16 * MiB + 8 * MiB) << report;
-    EXPECT_EQ(dirtyByCategory(report, "Shared with ", report.find("[" + parent + "]: 64-bit"))["memfd"], 16 * MiB);
-    EXPECT_EQ(dirtyByCategory(report, "Shared with ", report.find("[" + child + "]: 64-bit"))["memfd"], 8 * MiB);
+    EXPECT_EQ(RKDirtyByCategory(report, "Summary Memspread: ")["memfd"], 16 * MiB + 8 * MiB) << report;
+    EXPECT_EQ(RKDirtyByCategory(report, "Shared with ", report.find("[" + parent + "]: 64-bit"))["memfd"], 16 * MiB);
+    EXPECT_EQ(RKDirtyByCategory(report, "Shared with ", report.find("[" + child + "]: 64-bit"))["memfd"], 8 * MiB);
     if (geteuid() != 0) return;
     // file_halves whole, beside a few pages of the program's own libraries.
-    uint64_t files = dirtyByCategory(report, "Summary Memspread: ")["mapped file"];
+    uint64_t files = RKDirtyByCategory(report, "Summary Memspread: ")["mapped file"];
     EXPECT_GE(files, 16 * MiB + 8 * P);
     EXPECT_LT(files, 18 * MiB) << report;
-    EXPECT_GE(dirtyByCategory(report, "Shared with ", report.find("[" + child + "]: 64-bit"))["mapped file"], 8 * MiB);
+    EXPECT_GE(RKDirtyByCategory(report, "Shared with ", report.find("[" + child + "]: 64-bit"))["mapped file"], 8 * MiB);
 }
 
 TEST(RKPageLevel, PageStatesAgreeWithTheKernelsCounts) {
@@ -143,7 +133,7 @@ TEST(RKPageLevel, MemfdHalvesWithoutRoot) {
     RKCommandResult run = RKRunCommand(RKCommandAsNobody({"-f", "bytes", std::to_string(fixture.pid()),
                                                           std::to_string(fixture.childPid())}));
     ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
-    EXPECT_EQ(dirtyByCategory(run.standardOutput, "Summary Memspread: ")["memfd"], 16 * MiB + 8 * MiB) << run.standardOutput;
+    EXPECT_EQ(RKDirtyByCategory(run.standardOutput, "Summary Memspread: ")["memfd"], 16 * MiB + 8 * MiB) << run.standardOutput;
     // Anonymous pages inherited across the fork cannot be attributed without frames: one
     // warning bounds what the summary may count twice.
     const uint64_t bound = sharedAnonymousBytes(fixture.pid()) + sharedAnonymousBytes(fixture.childPid());

@@ -11,6 +11,7 @@
 #include <regex>
 
 #include "support/RKFixtureProcess.h"
+#include "support/RKReportRows.h"
 #include "support/RKRunCommand.h"
 
 namespace {
@@ -29,16 +30,6 @@ uint64_t statusField(pid_t pid, const std::string& file, const std::string& fiel
     while (std::getline(in, line))
         if (line.rfind(field + ":", 0) == 0) return std::stoull(line.substr(field.size() + 1)) * 1024;
     return 0;
-}
-
-std::map<std::string, uint64_t> dirtyByCategory(const std::string& report, size_t from) {
-    static const std::regex row(R"(^ *(\d+) B +\d+ B +\d+ B +\d+    (.+)$)");
-    std::map<std::string, uint64_t> rows;
-    for (const std::string& line : RKSplitLines(report.substr(std::min(from, report.size())))) {
-        std::smatch match;
-        if (!rows.count("TOTAL") && std::regex_match(line, match, row)) rows[match[2]] = std::stoull(match[1]);
-    }
-    return rows;
 }
 
 std::vector<pid_t> treeOf(const RKFixtureProcess& fixture, const std::string& report) {
@@ -73,7 +64,7 @@ TEST(RKSharedAnonymous, ForkedWorkersShareTheirParentsMemoryOnce) {
         ASSERT_TRUE(std::regex_search(report, match, header));
         EXPECT_EQ(std::stoull(match[1]), kernel);
     }
-    auto summary = dirtyByCategory(report, report.find("Summary Memspread: "));
+    auto summary = RKDirtyByCategory(report, "Summary Memspread: ");
     // Anonymous pages live in these categories (a private file mapping's copies under its file).
     const uint64_t anonymous = summary["anonymous"] + summary["heap"] + summary["stack"] + summary["mapped file"];
     EXPECT_NEAR(static_cast<double>(anonymous), static_cast<double>(pssAnon), 0.01 * static_cast<double>(pssAnon))
@@ -83,10 +74,10 @@ TEST(RKSharedAnonymous, ForkedWorkersShareTheirParentsMemoryOnce) {
     const size_t parentSection = report.find("[" + std::to_string(fixture.pid()) + "]: 64-bit");
     const size_t all = report.find("Shared with 21 processes:", parentSection);
     ASSERT_NE(all, std::string::npos) << report;
-    EXPECT_GE(dirtyByCategory(report, all)["anonymous"], fixture.area("mappings")->size - 20 * P);
-    EXPECT_GE(dirtyByCategory(report, all)["heap"], fixture.area("heap")->size - 20 * P);
+    EXPECT_GE(RKDirtyByCategory(report, "", all)["anonymous"], fixture.area("mappings")->size - 20 * P);
+    EXPECT_GE(RKDirtyByCategory(report, "", all)["heap"], fixture.area("heap")->size - 20 * P);
     // A page a worker copied is its own.
-    auto own = dirtyByCategory(report, report.find("[" + std::to_string(fixture.childPid()) + "]: 64-bit"));
+    auto own = RKDirtyByCategory(report, "[" + std::to_string(fixture.childPid()) + "]: 64-bit");
     EXPECT_GE(own["anonymous"], P);
     EXPECT_GE(own["heap"], P);
 }
@@ -135,7 +126,7 @@ TEST(RKSharedAnonymous, PagesMergedByKsmAreSharedByTheirPair) {
     ASSERT_NE(pair, std::string::npos) << report;
     // The merged pages, and any page the parent copied after forking both (then still shared
     // by the two alone).
-    EXPECT_GE(dirtyByCategory(report, pair)["anonymous"], 64 * P) << report;
+    EXPECT_GE(RKDirtyByCategory(report, "", pair)["anonymous"], 64 * P) << report;
 }
 
 }  // namespace
