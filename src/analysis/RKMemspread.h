@@ -56,6 +56,8 @@ public:
 
     // ---- Steps of the analysis, public so that each can be checked on its own ----
     void _addProcess(const RKProcess& process);
+    // Anonymous pages shared across fork or by KSM, counted once (RKSharedAnonymousPass.cpp).
+    void _attributeSharedAnonymousPages();
     void finalizeObjects();
     void _buildProcessToMemspreadMap();
     const RKPidToMemspreadMap& pidToMemspread() const { return pidToMemspread_; }

@@ -63,6 +63,7 @@ RKIdentityMaps::RKIdentityMaps(size_t processCount) {
 void RKMemspread::analyzeData() {
     pidToMemspread_.clear();
     identityMaps_ = std::make_unique<RKIdentityMaps>(processes_.size());
+    _attributeSharedAnonymousPages();
     for (const auto& process : processes_) _addProcess(*process);
     for (RKMemoryObject* object : identityMaps_->ownedBySeveral) object->setOwnerPid(-1);
     finalizeObjects();

@@ -16,6 +16,7 @@ inline constexpr kern_return_t KERN_PROTECTION_FAILURE = 2;
 inline constexpr kern_return_t KERN_INVALID_ARGUMENT = 4;  // a page query of a process that is gone
 inline constexpr kern_return_t KERN_FAILURE = 5;
 inline constexpr kern_return_t KERN_RESOURCE_SHORTAGE = 6;  // out of file descriptors
+inline constexpr kern_return_t KERN_NOT_SUPPORTED = 46;      // the system cannot tell (frames hidden)
 inline constexpr kern_return_t MACH_SEND_INVALID_DEST = 0x10000003;  // the process is gone
 
 // pbi_flags bits.
@@ -194,3 +195,13 @@ struct RKPageQueryAbilities {
     // Physical frame numbers are visible, so pages can be identified across processes.
     bool frames = false;
 };
+
+// A page of private anonymous memory that other mappings may hold too (after fork, or merged
+// by KSM): its identity, the range it was found in and whether it is swapped. `page` is the
+// frame number of a present page, or the swap entry of a swapped one with RKSwappedPageKey set.
+struct RKSharedAnonymousPage {
+    uint64_t page = 0;
+    uint32_t range = 0;  // index in the ranges asked about
+    uint32_t swapped = 0;
+};
+inline constexpr uint64_t RKSwappedPageKey = 1ull << 63;

@@ -29,21 +29,6 @@ kern_return_t failureFor(int error) {
     return error == EACCES || error == EPERM ? KERN_PROTECTION_FAILURE : KERN_INVALID_ARGUMENT;
 }
 
-// pread of exactly `bytes`, looping on short reads; a read that ends early means the process
-// (or, for kpageflags, the frame range) is gone.
-bool preadAll(int fd, void* buffer, size_t bytes, uint64_t offset) {
-    auto* p = static_cast<char*>(buffer);
-    while (bytes > 0) {
-        ssize_t n = ::pread(fd, p, bytes, static_cast<off_t>(offset));
-        if (n < 0 && errno == EINTR) continue;
-        if (n <= 0) return false;
-        p += n;
-        bytes -= static_cast<size_t>(n);
-        offset += static_cast<uint64_t>(n);
-    }
-    return true;
-}
-
 RKLinuxPageProbe probe(const std::string& procRoot) {
     RKLinuxPageProbe result;
     RKUniqueFd pagemap(::open((procRoot + "/self/pagemap").c_str(), O_RDONLY | O_CLOEXEC));
@@ -57,14 +42,14 @@ RKLinuxPageProbe probe(const std::string& procRoot) {
                     RKPageIsPresent, RKPageIsPresent};
     result.pagemapScan = ::ioctl(pagemap.get(), kPagemapScan, &arg) >= 0;
     uint64_t entry = 0;
-    if (!preadAll(pagemap.get(), &entry, sizeof entry, address / page * 8)) return result;
+    if (!RKPreadAll(pagemap.get(), &entry, sizeof entry, address / page * 8)) return result;
     const uint64_t frame = entry & RKPagemapFrameMask;
     // Root in a user namespace, or without CAP_SYS_ADMIN, reads frame 0 for every page.
     result.frames = (entry & RKPagemapPresent) && frame != 0;
     if (!result.frames) return result;
     RKUniqueFd flags(::open((procRoot + "/kpageflags").c_str(), O_RDONLY | O_CLOEXEC));
     uint64_t word = 0;
-    result.kpageflags = flags.valid() && preadAll(flags.get(), &word, sizeof word, frame * 8);
+    result.kpageflags = flags.valid() && RKPreadAll(flags.get(), &word, sizeof word, frame * 8);
     return result;
 }
 
@@ -82,16 +67,19 @@ public:
         : pagemap_(pagemap), pageSize_(pageSize), probe_(probe) {}
 
     kern_return_t readRange(const RKPageQueryRange& range, uint64_t firstPage, std::span<uint32_t> out) {
-        if (probe_.pagemapScan && !probe_.kpageflags) return scanRange(range, out);
+        // PAGEMAP_SCAN skips holes and tells the zero page; frames are worth reading only where
+        // a page's flags change its disposition (dirty file pages, lazily freed ones).
+        const bool needFlags = probe_.kpageflags && (range.fileBacked || range.reusablePages > 0);
+        if (probe_.pagemapScan && !needFlags) return scanRange(range, out);
         std::vector<uint64_t>& entries = entries_;
         const uint64_t startPage = range.start / pageSize_;
         for (uint64_t done = 0; done < out.size(); done += kChunkPages) {
             uint64_t count = std::min<uint64_t>(kChunkPages, out.size() - done);
             entries.resize(count);
-            if (!preadAll(pagemap_, entries.data(), count * 8, (startPage + done) * 8)) return KERN_INVALID_ARGUMENT;
+            if (!RKPreadAll(pagemap_, entries.data(), count * 8, (startPage + done) * 8)) return KERN_INVALID_ARGUMENT;
             for (uint64_t i = 0; i < count; i++) {
                 out[done + i] = RKDispositionForPagemapEntry(entries[i], range.fileBacked, std::nullopt);
-                if (probe_.kpageflags && RKPagemapEntryNeedsFlags(entries[i], range.fileBacked))
+                if (needFlags && RKPagemapEntryNeedsFlags(entries[i], range.fileBacked))
                     lookups_.push_back({entries[i] & RKPagemapFrameMask, firstPage + done + i, range.fileBacked, entries[i]});
             }
         }
@@ -108,7 +96,7 @@ public:
         size_t next = 0;
         for (const RKFrameRun& run : RKCoalesceFrames(frames, kFlagsPerRead)) {
             words.resize(run.count);
-            bool read = preadAll(kpageflags, words.data(), run.count * 8, run.first * 8);
+            bool read = RKPreadAll(kpageflags, words.data(), run.count * 8, run.first * 8);
             for (; next < lookups_.size() && lookups_[next].frame < run.first + run.count; next++) {
                 const FlagLookup& lookup = lookups_[next];
                 // A frame past the end of memory leaves the page as pagemap alone says.
@@ -121,8 +109,10 @@ public:
 
 private:
     kern_return_t scanRange(const RKPageQueryRange& range, std::span<uint32_t> out) {
-        std::vector<RKPageScanRun> runs;
-        std::vector<RKPageScanRun> buffer(kScanRunsPerCall);
+        std::vector<RKPageScanRun>& runs = runs_;
+        std::vector<RKPageScanRun>& buffer = scanBuffer_;
+        runs.clear();
+        buffer.resize(kScanRunsPerCall);
         const uint64_t end = range.start + out.size() * pageSize_;
         for (uint64_t start = range.start; start < end;) {
             RKPmScanArg arg{sizeof(RKPmScanArg), 0, start, end, 0, reinterpret_cast<uintptr_t>(buffer.data()),
@@ -146,9 +136,24 @@ private:
     const RKLinuxPageProbe& probe_;
     std::vector<uint64_t> entries_;
     std::vector<FlagLookup> lookups_;
+    std::vector<RKPageScanRun> runs_;
+    std::vector<RKPageScanRun> scanBuffer_;
 };
 
 }  // namespace
+
+bool RKPreadAll(int fd, void* buffer, size_t bytes, uint64_t offset) {
+    auto* p = static_cast<char*>(buffer);
+    while (bytes > 0) {
+        ssize_t n = ::pread(fd, p, bytes, static_cast<off_t>(offset));
+        if (n < 0 && errno == EINTR) continue;
+        if (n <= 0) return false;
+        p += n;
+        bytes -= static_cast<size_t>(n);
+        offset += static_cast<uint64_t>(n);
+    }
+    return true;
+}
 
 const RKLinuxPageProbe& RKProbePageReading(const std::string& procRoot) {
     static std::mutex mutex;

@@ -17,6 +17,10 @@ struct RKLinuxPageProbe {
     bool frames = false;       // pagemap shows frame numbers (root, not in a user namespace)
     bool kpageflags = false;   // and /proc/kpageflags can be read for them
 };
+// pread of exactly `bytes` at `offset`, looping on short reads; false when the read ends early
+// (a process gone, a frame past the end of memory) or fails.
+bool RKPreadAll(int fd, void* buffer, size_t bytes, uint64_t offset);
+
 // Probes once per run and per /proc root; later calls answer the first result.
 const RKLinuxPageProbe& RKProbePageReading(const std::string& procRoot);
 

@@ -11,11 +11,12 @@ namespace {
 RKPageQueryRange unannouncedRange(const RKLinuxTask& task, uint64_t address, uint64_t size) {
     RKPageQueryRange range{address, size, false, 0};
     if (!task.snapshot) return range;
-    for (const RKLinuxRegion& region : task.snapshot->regions) {
-        if (region.vma.start <= address && address < region.vma.end) {
-            range.fileBacked = region.kind == RKVmaKind::File;
-            range.reusablePages = region.info.pages_reusable;
-        }
+    const auto& regions = task.snapshot->regions;
+    auto it = std::upper_bound(regions.begin(), regions.end(), address,
+                               [](uint64_t a, const RKLinuxRegion& r) { return a < r.vma.end; });
+    if (it != regions.end() && it->vma.start <= address) {
+        range.fileBacked = it->kind == RKVmaKind::File;
+        range.reusablePages = it->info.pages_reusable;
     }
     return range;
 }

@@ -39,6 +39,9 @@ public:
     // Page queries (RKLinuxPages.cpp).
     void preparePageRangeQueries(RKTask& task, const std::vector<RKPageQueryRange>& ranges) override;
     RKPageQueryAbilities pageQueryAbilities() override;
+    // Shared anonymous pages (RKLinuxSharedFrames.cpp).
+    kern_return_t sharedAnonymousPages(RKTask& task, const std::vector<RKPageQueryRange>& ranges,
+                                       std::vector<RKSharedAnonymousPage>& pages, uint64_t& sharedBytes) override;
 
     // Per-process figures (RKLinuxFigures.cpp).
     int pidRusage(RKTask& task, RKRusageInfo& info) override;

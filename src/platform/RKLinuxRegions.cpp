@@ -22,11 +22,22 @@ const RKLinuxRegion* regionContaining(const RKLinuxWalkSnapshot& snapshot, uint6
     return region && region->vma.start <= address ? region : nullptr;
 }
 
+void rememberSharedAnonymous(RKLinuxTask& task) {
+    task.sharedAnonymousBytes.clear();
+    for (const RKLinuxRegion& region : task.snapshot->regions) {
+        const uint64_t shared = (region.vma.sharedClean + region.vma.sharedDirty) * 1024;
+        if (region.kind == RKVmaKind::Anonymous && !(region.vma.perms & RKSmapsShared) && shared > 0)
+            task.sharedAnonymousBytes.emplace_back(region.vma.start, shared);
+    }
+}
+
 // Loads a snapshot when none is held, or always when `fresh` (a walk starting over).
 kern_return_t ensureSnapshot(RKLinuxPlatform& platform, RKLinuxTask& task, bool fresh) {
     if (task.snapshot && !fresh) return KERN_SUCCESS;
     RKRecycleWalkSnapshot(std::move(task.snapshot));
-    return RKLoadWalkSnapshot(task, platform.procRoot(), platform.kernelPageSize(), task.snapshot);
+    kern_return_t result = RKLoadWalkSnapshot(task, platform.procRoot(), platform.kernelPageSize(), task.snapshot);
+    if (result == KERN_SUCCESS) rememberSharedAnonymous(task);
+    return result;
 }
 
 }  // namespace

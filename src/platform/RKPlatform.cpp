@@ -42,6 +42,7 @@ const char* mach_error_string(kern_return_t code) {
         case KERN_INVALID_ARGUMENT: return "process is gone";
         case KERN_FAILURE: return "failure";
         case KERN_RESOURCE_SHORTAGE: return "too many open files";
+        case KERN_NOT_SUPPORTED: return "not supported";
         case MACH_SEND_INVALID_DEST: return "process is gone";
         default: return "unknown error";
     }

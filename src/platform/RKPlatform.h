@@ -90,6 +90,14 @@ public:
     virtual void preparePageRangeQueries(RKTask& task, const std::vector<RKPageQueryRange>& ranges) = 0;
     // What page queries can tell on this system; probed once per run.
     virtual RKPageQueryAbilities pageQueryAbilities() = 0;
+    // The anonymous pages of the private `ranges` (ascending, disjoint; in a file mapping its
+    // copied-on-write pages) that more than one mapping holds, sorted by `page`; never the zero
+    // pages. KERN_SUCCESS; KERN_NOT_SUPPORTED
+    // when frames are hidden, with `sharedBytes` = what the kernel counts as shared in those
+    // ranges (the bound of what cannot be attributed); KERN_INVALID_ARGUMENT when the process
+    // is gone.
+    virtual kern_return_t sharedAnonymousPages(RKTask& task, const std::vector<RKPageQueryRange>& ranges,
+                                               std::vector<RKSharedAnonymousPage>& pages, uint64_t& sharedBytes) = 0;
 
     // ---- Per-process figures ----
     // proc_pid_rusage: 0, or the errno of the failure.

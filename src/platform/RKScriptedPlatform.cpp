@@ -186,6 +186,26 @@ void RKScriptedPlatform::preparePageRangeQueries(RKTask& task, const std::vector
 
 RKPageQueryAbilities RKScriptedPlatform::pageQueryAbilities() { return pageAbilities; }
 
+kern_return_t RKScriptedPlatform::sharedAnonymousPages(RKTask& task, const std::vector<RKPageQueryRange>& ranges,
+                                                       std::vector<RKSharedAnonymousPage>& pages, uint64_t& sharedBytes) {
+    record("sharedAnonymousPages", task.pid());
+    pages.clear();
+    sharedBytes = 0;
+    auto* process = find(task.pid());
+    if (!process) return KERN_INVALID_ARGUMENT;
+    if (process->sharedAnonymousResult != KERN_SUCCESS) {
+        sharedBytes = process->sharedAnonymousBytes;
+        return process->sharedAnonymousResult;
+    }
+    for (uint32_t r = 0; r < ranges.size(); r++) {
+        for (auto it = process->sharedAnonymous.lower_bound(ranges[r].start);
+             it != process->sharedAnonymous.end() && it->first < ranges[r].start + ranges[r].size; ++it)
+            pages.push_back({it->second, r, (it->second & RKSwappedPageKey) ? 1u : 0u});
+    }
+    std::sort(pages.begin(), pages.end(), [](const auto& a, const auto& b) { return a.page < b.page; });
+    return KERN_SUCCESS;
+}
+
 int RKScriptedPlatform::pidRusage(RKTask& task, RKRusageInfo& info) {
     record("pidRusage", task.pid());
     auto* process = find(task.pid());

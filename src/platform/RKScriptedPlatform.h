@@ -41,6 +41,11 @@ struct RKScriptedProcess {
     kern_return_t pageQueryResult = KERN_SUCCESS;
     // The ranges of every preparePageRangeQueries call, in order (an empty list releases).
     std::vector<std::vector<RKPageQueryRange>> preparedRanges;
+    // Shared anonymous pages by page address: the frame (or RKSwappedPageKey | swap entry).
+    // sharedAnonymousResult != KERN_SUCCESS answers that, with sharedAnonymousBytes.
+    std::map<uint64_t, uint64_t> sharedAnonymous;
+    kern_return_t sharedAnonymousResult = KERN_SUCCESS;
+    uint64_t sharedAnonymousBytes = 0;
     int rusageErrno = 0;
     RKRusageInfo rusage;
     int ledgerErrno = 0;
@@ -123,6 +128,8 @@ public:
                                  uint32_t* dispositions, uint64_t& count) override;
     void preparePageRangeQueries(RKTask& task, const std::vector<RKPageQueryRange>& ranges) override;
     RKPageQueryAbilities pageQueryAbilities() override;
+    kern_return_t sharedAnonymousPages(RKTask& task, const std::vector<RKPageQueryRange>& ranges,
+                                       std::vector<RKSharedAnonymousPage>& pages, uint64_t& sharedBytes) override;
     int pidRusage(RKTask& task, RKRusageInfo& info) override;
     int ledgerTemplate(std::vector<std::string>& names) override;
     int ledgerEntries(RKTask& task, std::vector<int64_t>& balances) override;

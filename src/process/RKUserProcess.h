@@ -59,6 +59,10 @@ struct RKRegionWalkState {
     // Regions waiting for their subranges until the walk is over, so that the process's page
     // data is read once, for these regions only (RKUserProcessPages.cpp).
     std::vector<RKSubrangeCandidate> subrangeCandidates;
+    // Private anonymous regions holding pages other mappings hold too, and their ranges
+    // (RKUserProcessSharedAnonymous.cpp).
+    std::vector<std::shared_ptr<RKMemoryRegion>> sharedAnonymousRegions;
+    std::vector<RKPageQueryRange> sharedAnonymousRanges;
 };
 
 // Architectures that decide where the shared library cache is mapped.
@@ -140,6 +144,22 @@ public:
     // After the walk: reads the noted regions' page data at once and builds their subranges.
     void _addPendingSubranges(RKRegionWalkState& state);
 
+    // ---- Anonymous pages shared across fork or by KSM (RKUserProcessSharedAnonymous.cpp) ----
+    // Notes a private anonymous region that smaps says shares pages; true when its pages will
+    // be identified one by one (frames visible), so subranges would only count them twice.
+    bool _noteSharedAnonymousRegion(const std::shared_ptr<RKMemoryRegion>& region, const RKRegionSubmapInfo& info,
+                                    RKRegionWalkState& state);
+    // After the walk: reads the noted regions' shared pages, or where frames are hidden the
+    // bytes the kernel counts as shared in them.
+    void _gatherSharedAnonymousPages(RKRegionWalkState& state);
+    // The shared pages, sorted by page; `range` indexes sharedAnonymousRegions(). Held from
+    // gathering until the pass across processes has attributed them.
+    std::vector<RKSharedAnonymousPage>& sharedAnonymousPages() { return sharedAnonymousPages_; }
+    const std::vector<std::shared_ptr<RKMemoryRegion>>& sharedAnonymousRegions() const { return sharedAnonymousRegions_; }
+    void releaseSharedAnonymousPages();
+    // Anonymous bytes shared with other mappings that could not be attributed (frames hidden).
+    uint64_t unattributedSharedAnonymousBytes() const { return unattributedSharedAnonymousBytes_; }
+
     // Reads the loaded images into `images`, sorted by start (RKUserProcessImages.cpp).
     virtual void _gatherImageData();
     // Names a region after the image segment it lies in; false when it lies in none.
@@ -201,6 +221,9 @@ protected:
     // Not owned: the region lives in the walk's region list until the walk is over.
     RKMemoryRegion* pendingUnusedSharedRegion_ = nullptr;
     bool pageQueryFailed_ = false;  // a page query failed: the process is gone or unreadable
+    std::vector<RKSharedAnonymousPage> sharedAnonymousPages_;
+    std::vector<std::shared_ptr<RKMemoryRegion>> sharedAnonymousRegions_;
+    uint64_t unattributedSharedAnonymousBytes_ = 0;
 
 private:
     // task_for_pid and the start-time check; the task is kept only on success.

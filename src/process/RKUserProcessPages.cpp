@@ -182,6 +182,7 @@ void RKUserProcess::_addSubrangesForRegion(RKMemoryRegion& region, int purgeStat
 
 void RKUserProcess::_addSubrangesIfEligible(const std::shared_ptr<RKMemoryRegion>& region, const RKRegionSubmapInfo& info,
                                             int purgeState, RKRegionWalkState& state) {
+    if (_noteSharedAnonymousRegion(region, info, state)) return;
     if (!state.breakDown || state.sharingAnalysisDisabled || state.hidden ||
         !region->eligibleForSubrangesUsingPageSize(pageSize()))
         return;

@@ -186,6 +186,7 @@ void RKUserProcess::_gatherMemoryData() {
         return _addRegionForEntry(state, start, size, info, purgeState, path, name, verbose);
     });
     _addPendingSubranges(state);
+    _gatherSharedAnonymousPages(state);
     _addUnconsumedOwnedObjectRegions(state);
     ownedVmObjects_.reset();
     _reconcileUnmappedOwnedRegion(state);

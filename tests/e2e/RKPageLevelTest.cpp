@@ -17,6 +17,7 @@
 #include "process/RKAnalysisSettings.h"
 #include "process/RKUserProcess.h"
 #include "support/RKFixtureProcess.h"
+#include "support/RKReportRows.h"
 #include "support/RKRunCommand.h"
 #include "support/RKUnprivileged.h"
 
@@ -24,17 +25,6 @@ namespace {
 
 const uint64_t P = static_cast<uint64_t>(sysconf(_SC_PAGESIZE));
 const uint64_t MiB = 1 << 20;
-
-// The Dirty column by category of the table after the first `heading` at or after `from`.
-std::map<std::string, uint64_t> dirtyByCategory(const std::string& report, const std::string& heading, size_t from = 0) {
-    static const std::regex row(R"(^ *(\d+) B +\d+ B +\d+ B +\d+    (.+)$)");
-    std::map<std::string, uint64_t> rows;
-    for (const std::string& line : RKSplitLines(report.substr(std::min(report.find(heading, from), report.size())))) {
-        std::smatch match;
-        if (!rows.count("TOTAL") && std::regex_match(line, match, row)) rows[match[2]] = std::stoull(match[1]);
-    }
-    return rows;
-}
 
 // A "Name: N kB" field, in bytes, of the smaps entry at `address` (or of a status-like file).
 uint64_t kernelField(const std::string& file, const std::string& field, uint64_t address = 0) {
@@ -47,6 +37,26 @@ uint64_t kernelField(const std::string& file, const std::string& field, uint64_t
         if (inside && line.rfind(field + ":", 0) == 0) return std::stoull(line.substr(field.size() + 1)) * 1024;
     }
     return 0;
+}
+
+// Shared_Clean + Shared_Dirty of the private anonymous mappings of `pid`, in bytes.
+uint64_t sharedAnonymousBytes(pid_t pid) {
+    std::ifstream in("/proc/" + std::to_string(pid) + "/smaps");
+    static const std::regex header(R"(^[0-9a-f]+-[0-9a-f]+ \S{3}(.) \S+ \S+ (\d+) *(.*)$)");
+    std::string line;
+    bool anonymous = false;
+    uint64_t bytes = 0;
+    while (std::getline(in, line)) {
+        std::smatch match;
+        if (std::regex_match(line, match, header)) {
+            const std::string path = match[3];
+            anonymous = match[1] == "p" && match[2] == "0" &&
+                        (path.empty() || path == "[heap]" || path == "[stack]" || path.starts_with("[anon:"));
+        } else if (anonymous && (line.starts_with("Shared_Clean:") || line.starts_with("Shared_Dirty:"))) {
+            bytes += std::stoull(line.substr(13)) * 1024;
+        }
+    }
+    return bytes;
 }
 
 const RKMemoryRegion* regionAt(const RKProcess& process, uint64_t address) {
@@ -71,42 +81,49 @@ TEST(RKPageLevel, HalvesWrittenByParentAndChildCountOnceEach) {
     ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
     const std::string& report = run.standardOutput;
     // memfd_halves whole (16 MiB) and the touched half of memfd_half.
-    EXPECT_EQ(dirtyByCategory(report, "Summary Memspread: ")["memfd"], 16 * MiB + 8 * MiB) << report;
-    EXPECT_EQ(dirtyByCategory(report, "Shared with ", report.find("[" + parent + "]: 64-bit"))["memfd"], 16 * MiB);
-    EXPECT_EQ(dirtyByCategory(report, "Shared with ", report.find("[" + child + "]: 64-bit"))["memfd"], 8 * MiB);
+    EXPECT_EQ(RKDirtyByCategory(report, "Summary Memspread: ")["memfd"], 16 * MiB + 8 * MiB) << report;
+    EXPECT_EQ(RKDirtyByCategory(report, "Shared with ", report.find("[" + parent + "]: 64-bit"))["memfd"], 16 * MiB);
+    EXPECT_EQ(RKDirtyByCategory(report, "Shared with ", report.find("[" + child + "]: 64-bit"))["memfd"], 8 * MiB);
     if (geteuid() != 0) return;
     // file_halves whole, beside a few pages of the program's own libraries.
-    uint64_t files = dirtyByCategory(report, "Summary Memspread: ")["mapped file"];
+    uint64_t files = RKDirtyByCategory(report, "Summary Memspread: ")["mapped file"];
     EXPECT_GE(files, 16 * MiB + 8 * P);
     EXPECT_LT(files, 18 * MiB) << report;
-    EXPECT_GE(dirtyByCategory(report, "Shared with ", report.find("[" + child + "]: 64-bit"))["mapped file"], 8 * MiB);
+    EXPECT_GE(RKDirtyByCategory(report, "Shared with ", report.find("[" + child + "]: 64-bit"))["mapped file"], 8 * MiB);
 }
 
-TEST(RKPageLevel, SubrangesAgreeWithTheKernelsCounts) {
+TEST(RKPageLevel, PageStatesAgreeWithTheKernelsCounts) {
     RKFixtureProcess fixture;
     ASSERT_TRUE(fixture.start(MEMSPREAD_HALVES_FIXTURE)) << fixture.error();
+    const std::string proc = "/proc/" + std::to_string(fixture.pid());
     auto parent = gathered(fixture.pid());
     ASSERT_TRUE(parent);
-    const std::string smaps = "/proc/" + std::to_string(fixture.pid()) + "/smaps";
 
+    // Pages only read map the zero page, which is never memory: the 8 written pages alone,
+    // from page data (subranges) without root, from the region and its shared pages with it.
     const RKMemoryRegion* zeroRead = regionAt(*parent, fixture.area("anon_zero_read")->address);
-    ASSERT_TRUE(zeroRead && zeroRead->subrangeList());
-    EXPECT_EQ(zeroRead->subrangeList()->sum().dirty, 8 * P) << "pages only read map the zero page: nothing dirty";
-
-    if (geteuid() != 0) GTEST_SKIP() << "lazily freed pages and dirty file pages need /proc/kpageflags";
-    const uint64_t lazyAddress = fixture.area("anon_lazy_free")->address;
-    const RKMemoryRegion* lazy = regionAt(*parent, lazyAddress);
-    ASSERT_TRUE(lazy && lazy->subrangeList());
-    EXPECT_EQ(lazy->subrangeList()->sum().reclaimable, kernelField(smaps, "LazyFree", lazyAddress));
-    EXPECT_GT(lazy->subrangeList()->sum().reclaimable, 0u);
+    ASSERT_TRUE(zeroRead);
+    const uint64_t zeroReadDirty = zeroRead->subrangeList() ? zeroRead->subrangeList()->sum().dirty : zeroRead->dirtySize;
+    EXPECT_EQ(zeroReadDirty, 8 * P);
 
     const uint64_t lockedAddress = fixture.area("locked_file")->address;
     const RKMemoryRegion* locked = regionAt(*parent, lockedAddress);
     ASSERT_TRUE(locked);
-    EXPECT_EQ(locked->wiredSize(), kernelField(smaps, "Locked", lockedAddress));
+    EXPECT_EQ(locked->wiredSize(), kernelField(proc + "/smaps", "Locked", lockedAddress));
     if (locked->subrangeList()) {
         EXPECT_EQ(locked->subrangeList()->sum().wired, 16 * P) << "every run is wired";
     }
+
+    // In the report, what is reclaimable is what the kernel calls lazily freed, to the page.
+    RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", std::to_string(fixture.pid())});
+    ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
+    static const std::regex row(R"(^ *\d+ B +\d+ B +(\d+) B +\d+    TOTAL$)");
+    std::smatch match;
+    uint64_t reclaimable = 0;
+    for (const std::string& line : RKSplitLines(run.standardOutput))
+        if (std::regex_match(line, match, row)) reclaimable += std::stoull(match[1]);
+    EXPECT_EQ(reclaimable, kernelField(proc + "/smaps_rollup", "LazyFree"));
+    EXPECT_GT(reclaimable, 0u) << run.standardOutput;
 }
 
 TEST(RKPageLevel, MemfdHalvesWithoutRoot) {
@@ -116,7 +133,14 @@ TEST(RKPageLevel, MemfdHalvesWithoutRoot) {
     RKCommandResult run = RKRunCommand(RKCommandAsNobody({"-f", "bytes", std::to_string(fixture.pid()),
                                                           std::to_string(fixture.childPid())}));
     ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
-    EXPECT_EQ(dirtyByCategory(run.standardOutput, "Summary Memspread: ")["memfd"], 16 * MiB + 8 * MiB) << run.standardOutput;
+    EXPECT_EQ(RKDirtyByCategory(run.standardOutput, "Summary Memspread: ")["memfd"], 16 * MiB + 8 * MiB) << run.standardOutput;
+    // Anonymous pages inherited across the fork cannot be attributed without frames: one
+    // warning bounds what the summary may count twice.
+    const uint64_t bound = sharedAnonymousBytes(fixture.pid()) + sharedAnonymousBytes(fixture.childPid());
+    EXPECT_GT(bound, 0u);
+    EXPECT_NE(run.standardError.find("memspread: " + std::to_string(bound) + " bytes of anonymous memory are shared"),
+              std::string::npos)
+        << run.standardError;
 }
 
 // The process is killed and reaped after its walk, before its page data is read.

@@ -1,0 +1,30 @@
+// Anonymous memory shared across fork or merged by KSM, counted once in its exact sharing set.
+//
+// Runs after gathering and before identity. Every measured process brings the pages of its
+// private anonymous regions that other mappings hold too, by frame (or swap entry). One merge of
+// those sorted lists finds, for each page, the measured processes that map it; a page only one
+// of them maps stays that process's private memory. Each sharing set (and category name) becomes
+// one memory object whose identity is the set: every member gets a region without an address
+// whose subranges lie at the page's index in the set's ascending frame list (the same index in
+// every member), so the range list counts the page once and the sharing groups put it with
+// exactly that set. The regions the pages came from lose them.
+//
+// Memory: the 16-byte page records the processes hold, nothing per page after the pass; time
+// linear in pages (times log of the number of processes, for the merge).
+#pragma once
+
+#include <memory>
+#include <vector>
+
+#include "process/RKProcess.h"
+
+struct RKSharedAnonymousSummary {
+    uint64_t sharedPages = 0;        // distinct pages that at least two measured processes map
+    uint64_t unattributedBytes = 0;  // shared anonymous bytes of processes whose frames are hidden
+};
+
+RKSharedAnonymousSummary RKAttributeSharedAnonymousPages(const std::vector<std::shared_ptr<RKProcess>>& processes);
+
+// Object ids of sharing sets: bit 61 alone of the top three, so never a file object (bit 63) or
+// a private id (bit 62).
+inline constexpr uint64_t RKSharedAnonymousObjectIdBase = 1ull << 61;

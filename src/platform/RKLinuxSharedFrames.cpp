@@ -1,0 +1,101 @@
+// The anonymous pages a process shares with other mappings (after fork, or merged by KSM),
+// identified by frame number, or by swap entry when swapped: pagemap read in chunks, then
+// /proc/kpagecount and /proc/kpageflags over runs of consecutive frames. Exclusivity comes
+// from kpagecount, not pagemap's bit 56, which is wrong for PMD-mapped huge pages.
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+
+#include "platform/RKLinuxPageReader.h"
+#include "platform/RKLinuxPlatform.h"
+#include "platform/RKLinuxTask.h"
+#include "platform/RKPageDispositions.h"
+#include "platform/RKUniqueFd.h"
+
+namespace {
+
+constexpr uint64_t kChunkPages = 4096;
+constexpr uint64_t kFramesPerRead = 4096;
+
+// Every present page (by frame) and swapped page (by swap entry) of the ranges.
+kern_return_t readCandidates(int pagemap, uint64_t pageSize, const std::vector<RKPageQueryRange>& ranges,
+                             std::vector<RKSharedAnonymousPage>& pages) {
+    std::vector<uint64_t> entries;
+    for (uint32_t r = 0; r < ranges.size(); r++) {
+        const uint64_t first = ranges[r].start / pageSize;
+        const uint64_t count = (ranges[r].start % pageSize + ranges[r].size + pageSize - 1) / pageSize;
+        for (uint64_t done = 0; done < count; done += kChunkPages) {
+            entries.resize(std::min(kChunkPages, count - done));
+            if (!RKPreadAll(pagemap, entries.data(), entries.size() * 8, (first + done) * 8)) return KERN_INVALID_ARGUMENT;
+            for (uint64_t entry : entries) {
+                if (ranges[r].fileBacked && (entry & RKPagemapFilePage)) continue;  // page cache, not a copy
+                if ((entry & RKPagemapPresent) && (entry & RKPagemapFrameMask) != 0)
+                    pages.push_back({entry & RKPagemapFrameMask, r, 0});
+                else if (!(entry & RKPagemapPresent) && (entry & RKPagemapSwapped))
+                    pages.push_back({RKSwappedPageKey | (entry & RKPagemapFrameMask), r, 1});
+            }
+        }
+    }
+    return KERN_SUCCESS;
+}
+
+// Keeps the present pages that more than one mapping holds and that are no zero page, and
+// every swapped page (only the pass across processes can tell who else holds those).
+void keepShared(int kpagecount, int kpageflags, std::vector<RKSharedAnonymousPage>& pages) {
+    std::vector<uint64_t> counts, flags;
+    size_t kept = 0;
+    size_t i = 0;
+    while (i < pages.size()) {
+        if (pages[i].page & RKSwappedPageKey) {
+            pages[kept++] = pages[i++];
+            continue;
+        }
+        // One run of frames: from this page's frame up to kFramesPerRead frames on, as far as
+        // the sorted pages stay dense enough to be worth one read.
+        const uint64_t first = pages[i].page;
+        size_t j = i;
+        uint64_t last = first;
+        while (j < pages.size() && !(pages[j].page & RKSwappedPageKey) && pages[j].page < first + kFramesPerRead &&
+               pages[j].page <= last + 64)
+            last = pages[j++].page;
+        const uint64_t length = last - first + 1;
+        counts.resize(length);
+        flags.resize(length);
+        const bool read = RKPreadAll(kpagecount, counts.data(), length * 8, first * 8) &&
+                          RKPreadAll(kpageflags, flags.data(), length * 8, first * 8);
+        for (; i < j; i++) {
+            const uint64_t at = pages[i].page - first;
+            if (read && counts[at] > 1 && !(flags[at] & RKKpfZeroPage)) pages[kept++] = pages[i];
+        }
+    }
+    pages.resize(kept);
+}
+
+}  // namespace
+
+kern_return_t RKLinuxPlatform::sharedAnonymousPages(RKTask& task, const std::vector<RKPageQueryRange>& ranges,
+                                                    std::vector<RKSharedAnonymousPage>& pages, uint64_t& sharedBytes) {
+    pages.clear();
+    sharedBytes = 0;
+    auto* target = dynamic_cast<RKLinuxTask*>(&task);
+    if (!target) return KERN_INVALID_ARGUMENT;
+    if (!RKProbePageReading(procRoot()).kpageflags) {
+        for (const RKPageQueryRange& range : ranges)
+            for (const auto& [start, bytes] : target->sharedAnonymousBytes)
+                if (start == range.start) sharedBytes += bytes;
+        return KERN_NOT_SUPPORTED;
+    }
+    RKUniqueFd pagemap(::openat(target->directoryFd(), "pagemap", O_RDONLY | O_CLOEXEC));
+    if (!pagemap.valid()) return errno == EACCES || errno == EPERM ? KERN_PROTECTION_FAILURE : KERN_INVALID_ARGUMENT;
+    kern_return_t result = readCandidates(pagemap.get(), kernelPageSize(), ranges, pages);
+    if (result != KERN_SUCCESS) return result;
+    std::sort(pages.begin(), pages.end(), [](const auto& a, const auto& b) { return a.page < b.page; });
+    RKUniqueFd kpagecount(::open((procRoot() + "/kpagecount").c_str(), O_RDONLY | O_CLOEXEC));
+    RKUniqueFd kpageflags(::open((procRoot() + "/kpageflags").c_str(), O_RDONLY | O_CLOEXEC));
+    if (!kpagecount.valid() || !kpageflags.valid()) return KERN_NOT_SUPPORTED;
+    keepShared(kpagecount.get(), kpageflags.get(), pages);
+    pages.shrink_to_fit();
+    return KERN_SUCCESS;
+}
