@@ -93,7 +93,7 @@ public:
     std::string _gatherName(const RKBsdInfo& info) override;
     // Opens the task again for gathering; false (after a warning for a process that is gone, an
     // error otherwise) when it cannot be.
-    bool _reopenTaskForGathering();
+    virtual bool _reopenTaskForGathering();
     // Closes the task: its descriptors go back for the next process.
     void _releaseTask() { task_.reset(); }
     bool _isAlive() const override { return true; }

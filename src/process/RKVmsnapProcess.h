@@ -27,6 +27,7 @@ public:
 
     uint64_t _gatherPageSize() override;
     bool _populateTask() override { return true; }  // there is no task
+    bool _reopenTaskForGathering() override { return true; }
     bool _isAlive() const override { return false; }
     void _gatherIsTranslated() override;
     void _gatherImageData() override {}  // images come with the regions

@@ -39,6 +39,8 @@ protected:
         testing::internal::CaptureStderr();
         auto made = std::dynamic_pointer_cast<RKUserProcess>(RKProcess::processWithPid(7));
         if (made && gather) made->gatherData();
+        // The steps called one by one read through the task that gathering would hold open.
+        if (made && !gather) made->_reopenTaskForGathering();
         printed = testing::internal::GetCapturedStderr();
         return made;
     }
