@@ -75,7 +75,7 @@ mlwriter_t mlwriter_open(const char* path, const char* name, int truncate, int d
 
 void mlwriter_set_description(mlwriter_t writer, const char* description) { writer->description = description; }
 
-void mlwriter_set_primary_metric(mlwriter_t writer, const char* spec) { writer->primaryMetric = spec; }
+void mlwriter_set_primary_metric(mlwriter_t writer, const char* metric) { writer->primaryMetric = metric; }
 
 void mlwriter_new_group(mlwriter_t writer) {
     writer->completeValue();

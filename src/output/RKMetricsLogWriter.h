@@ -18,7 +18,7 @@ enum mltag_t { mltag_summary, mltag_context };
 mlwriter_t mlwriter_open(const char* path, const char* name, int truncate, int durable);
 void mlwriter_set_description(mlwriter_t writer, const char* description);
 // The metric that best summarises the log: "name,variable=value".
-void mlwriter_set_primary_metric(mlwriter_t writer, const char* spec);
+void mlwriter_set_primary_metric(mlwriter_t writer, const char* metric);
 void mlwriter_new_group(mlwriter_t writer);
 // A value in the current group; the record calls that follow describe it.
 void mlwriter_new_value(mlwriter_t writer, const char* metric, mlunit_t unit, double value);

@@ -22,6 +22,7 @@
 #include "platform/RKLinuxWalk.h"
 #include "platform/RKOwnedObjectParsers.h"
 #include "platform/RKProcFile.h"
+#include "platform/RKProcStatParser.h"
 #include "platform/RKUniqueFd.h"
 
 namespace {
@@ -86,12 +87,10 @@ std::string linkTarget(int dirfd, const char* name) {
 }
 
 // What a descriptor's link tells apart: a memfd's name, a file's path.
-std::string detailFromLink(std::string link) {
-    constexpr std::string_view kDeleted = " (deleted)";
-    if (link.size() >= kDeleted.size() && link.compare(link.size() - kDeleted.size(), kDeleted.size(), kDeleted) == 0)
-        link.resize(link.size() - kDeleted.size());
-    if (link.rfind("/memfd:", 0) == 0) link.erase(0, 7);
-    return link;
+std::string detailFromLink(const std::string& link) {
+    std::string_view detail = RKWithoutDeletedSuffix(link);
+    if (detail.starts_with("/memfd:")) detail.remove_prefix(7);
+    return std::string(detail);
 }
 
 // A descriptor of our own on the file that `st` describes, for cachestat. The process may have

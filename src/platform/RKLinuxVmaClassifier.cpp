@@ -4,20 +4,13 @@
 #include <limits>
 
 #include "platform/RKLinuxTags.h"
+#include "platform/RKProcStatParser.h"
 
 namespace {
-
-constexpr std::string_view kDeleted = " (deleted)";
 
 bool startsWith(std::string_view s, std::string_view prefix) { return s.substr(0, prefix.size()) == prefix; }
 
 bool isBracketed(std::string_view path) { return !path.empty() && path.front() == '['; }
-
-std::string_view withoutDeleted(std::string_view path) {
-    if (path.size() >= kDeleted.size() && path.substr(path.size() - kDeleted.size()) == kDeleted)
-        path.remove_suffix(kDeleted.size());
-    return path;
-}
 
 // "[prefixNAME]" -> NAME, or nothing when `path` is not of that form.
 std::optional<std::string_view> bracketedName(std::string_view path, std::string_view prefix) {
@@ -251,10 +244,10 @@ std::string_view RKDetailForVma(const RKSmapsVma& vma, RKVmaKind kind) {
     if (auto name = bracketedName(path, "[anon:")) return *name;
     if (auto name = bracketedName(path, "[anon_shmem:")) return *name;
     if (isBracketed(path)) return {};
-    if (startsWith(path, "/memfd:")) return withoutDeleted(path.substr(7));
+    if (startsWith(path, "/memfd:")) return RKWithoutDeletedSuffix(path.substr(7));
     if (path == "/dev/zero (deleted)" || path == "/anon_hugepage (deleted)" || startsWith(path, "/secretmem"))
         return {};
-    if (isSysV(path)) return withoutDeleted(path);
+    if (isSysV(path)) return RKWithoutDeletedSuffix(path);
     return path;
 }
 

@@ -40,6 +40,12 @@ bool RKIsElf32Header(std::string_view header);
 // What the kernel appends to the link of an unlinked file.
 inline constexpr std::string_view RK_DELETED_SUFFIX = " (deleted)";
 
+// `path` without the kernel's " (deleted)" marker, where it ends with one.
+inline std::string_view RKWithoutDeletedSuffix(std::string_view path) {
+    if (path.ends_with(RK_DELETED_SUFFIX)) path.remove_suffix(RK_DELETED_SUFFIX.size());
+    return path;
+}
+
 // The executable path of a readlink of /proc/PID/exe, without the " (deleted)" that the kernel
 // appends once the file was unlinked. `unlinked` says whether the file is known to be gone: a
 // file may really be named "... (deleted)", so the marker is only dropped for unlinked files.

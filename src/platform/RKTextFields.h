@@ -13,22 +13,23 @@ inline std::string_view RKNextLine(std::string_view& text) {
     return line;
 }
 
-// The next space-separated word of `line` (empty at its end); `line` moves past it.
+// The next blank-separated word of `line` (empty at its end); `line` moves past it.
 inline std::string_view RKNextWord(std::string_view& line) {
-    size_t start = line.find_first_not_of(' ');
+    size_t start = line.find_first_not_of(" \t");
     if (start == std::string_view::npos) {
         line = {};
         return {};
     }
     line.remove_prefix(start);
-    size_t end = line.find(' ');
+    size_t end = line.find_first_of(" \t");
     std::string_view word = line.substr(0, end);
     line.remove_prefix(end == std::string_view::npos ? line.size() : end);
     return word;
 }
 
 // Whether `word` is a decimal number and nothing else.
-inline bool RKParseDecimal(std::string_view word, uint64_t& value) {
+template <typename Number>
+bool RKParseDecimal(std::string_view word, Number& value) {
     auto [end, ec] = std::from_chars(word.data(), word.data() + word.size(), value);
     return ec == std::errc() && end == word.data() + word.size() && !word.empty();
 }
