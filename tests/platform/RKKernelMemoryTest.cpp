@@ -138,7 +138,8 @@ TEST_F(RKKernelMemoryTest, AsRootTheRecordsAddUpToTheKernelsOwnFiguresWithStacks
     EXPECT_NEAR(double(collectable), double(figure("SReclaimable")), 0.01 * double(figure("SReclaimable")));
     EXPECT_EQ(nameOf(answer.zoneNames.back().mzn_name), "kmalloc (large)");
 
-    // Device memory, other owners' pages and stacks make no site (the exact sum above); callers are summed.
+    // Thread stacks make no site (they are KernelStack); callers are summed.
+    EXPECT_FALSE(site(VM_KERN_SITE_KERNEL, "kernel_clone"));
     const RKMemoryInfoRecord* maps = site(VM_KERN_SITE_KERNEL, "htab_map_alloc");
     ASSERT_TRUE(maps);
     EXPECT_EQ(maps->size, (641u + 577 + 513 + 128 + 128 + 16 + 14 + 2 + 2 + 2) * P);
@@ -165,6 +166,7 @@ TEST_F(RKKernelMemoryTest, ModulesAreCountedOnceAndWithoutRootOnlyMeminfoIsAnswe
     for (const auto& record : answer.sites)
         if ((record.flags & VM_KERN_SITE_TYPE) == VM_KERN_SITE_KMOD) modules += record.size;
     EXPECT_EQ(modules, 360448u + 73728 + 24576 + 16384 + 12288);
+    EXPECT_FALSE(site(VM_KERN_SITE_KERNEL, "module_memory_alloc"));
     EXPECT_EQ(kernelBytes(answer), kernelBytes(without) + modulePages * P)
         << "module memory is vmalloc memory: counted once, under the modules";
 
