@@ -59,13 +59,10 @@ TEST_F(RKKernelProcessTest, ZonesAreDirtyByTheirElementsInUseOnlyWhenCollectable
     ASSERT_TRUE(kernel && kernel->memoryRegions());
     const RKRegionList& regions = *kernel->memoryRegions();
     ASSERT_EQ(regions.size(), 3u) << "a name without a record makes no region";
-    EXPECT_EQ(regions[0]->name, "dentry");
-    EXPECT_EQ(regions[0]->dirtySize, 640u);
-    EXPECT_EQ(regions[0]->reclaimableSize, 15744u);
+    auto fields = [](const RKMemoryRegion& r) { return std::tuple(r.name, r.dirtySize, r.reclaimableSize); };
+    EXPECT_EQ(fields(*regions[0]), std::tuple("dentry", 640u, 15744u)) << "elements in use are dirty, the rest reclaimable";
     EXPECT_EQ(regions[0]->object_id, 0x200000000u);
-    EXPECT_EQ(regions[1]->name, std::string(80, 'z'));
-    EXPECT_EQ(regions[1]->dirtySize, 16384u);
-    EXPECT_EQ(regions[1]->reclaimableSize, 0u);
+    EXPECT_EQ(fields(*regions[1]), std::tuple(std::string(80, 'z'), 16384u, 0u)) << "not collectable: all dirty";
     EXPECT_EQ(regions[2]->name, "unknown");
     EXPECT_TRUE(kernel->warnings().empty() && kernel->errors().empty());
 }

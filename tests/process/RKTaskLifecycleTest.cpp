@@ -45,17 +45,9 @@ protected:
         listed().reusedBy = intruder;
         listed().reusedByExecutablePath = "/usr/bin/intruder";
     }
-    // Every process of the system, as -a selects them, with what selecting printed.
-    RKTargetMap all() {
-        testing::internal::CaptureStderr();
-        auto map = RKProcess::allProcessesExcludingPids({});
-        printed = testing::internal::GetCapturedStderr();
-        return map.value_or(RKTargetMap{});
-    }
 
     std::shared_ptr<RKScriptedPlatform> platform = std::make_shared<RKScriptedPlatform>();
     RKScopedPlatform scope{platform};
-    std::string printed;
 };
 
 }  // namespace
@@ -76,8 +68,11 @@ TEST_F(RKTaskLifecycleTest, TaskIsOpenOnlyWhileTheProcessIsRead) {
 TEST_F(RKTaskLifecycleTest, ReusedPidNeverReadAsTheListedProcess) {
     // Reused between listing and opening: the listed process is gone, nothing is made of it.
     reuse();
-    RKTargetMap targets = all();
-    EXPECT_EQ(targets.count(40), 0u);
+    testing::internal::CaptureStderr();
+    auto targets = RKProcess::allProcessesExcludingPids({});
+    const std::string printed = testing::internal::GetCapturedStderr();
+    ASSERT_TRUE(targets);
+    EXPECT_EQ(targets->count(40), 0u);
     EXPECT_EQ(platform->callCount("taskExecutablePath"), 0u) << "the intruder's name is never read";
     EXPECT_NE(printed.find("task_for_pid: process is gone"), std::string::npos) << printed;
 
