@@ -22,7 +22,7 @@ auto fields(const RKSysVSegment& s) { return std::tuple(s.shmid, s.size, s.creat
 
 }  // namespace
 
-TEST(RKOwnedObjectParsersTest, SysVTableGivesEachSegmentsCreatorAttachCountAndPages) {
+TEST(RKOwnedObjectParsersTest, SysVSegmentsAndDmaBufsAreReadFromTheKernelsTexts) {
     std::vector<RKSysVSegment> segments = RKParseSysVShm(testData("sysvipc-shm.txt"));
     ASSERT_EQ(segments.size(), 1u);
     EXPECT_EQ(fields(segments[0]), fields({62, 8388608, 7938, 0, 8388608, 0}));
@@ -33,9 +33,8 @@ TEST(RKOwnedObjectParsersTest, SysVTableGivesEachSegmentsCreatorAttachCountAndPa
     EXPECT_EQ(fields(segments[0]), fields({7, 4096, 100, 2, 4096, 0}));
     // A kernel that does not say how much is resident gives nothing rather than a guess.
     EXPECT_TRUE(RKParseSysVShm("key shmid perms size cpid lpid nattch\n0 7 600 4096 100 100 0\n").empty());
-}
 
-TEST(RKOwnedObjectParsersTest, DmaBufFdinfoGivesSizeInodeAndExporter) {
+    // A dma-buf's fdinfo gives its size, inode and exporter.
     auto info = RKParseDmaBufFdinfo(testData("fdinfo-dmabuf.txt"));
     ASSERT_TRUE(info);
     EXPECT_EQ(std::tie(info->size, info->inode, info->exporter), std::tuple(8294400u, 2051u, "system"));
