@@ -18,6 +18,7 @@
 #include "driver/RKMemspreadArgs.h"
 #include "platform/RKLinuxPlatform.h"
 #include "process/RKKernelProcess.h"
+#include "support/RKKeptArgv.h"
 #include "support/RKRunCommand.h"
 #include "support/RKUnprivileged.h"
 
@@ -86,11 +87,8 @@ protected:
     // Resolves a command line (without the program name) in this process, on the real /proc.
     Keys resolve(std::vector<std::string> arguments, RKError* error = nullptr) {
         RKScopedPlatform scope(std::make_shared<RKLinuxPlatform>());
-        arguments.insert(arguments.begin(), "memspread");
-        std::vector<char*> argv;
-        for (auto& argument : arguments) argv.push_back(argument.data());
-        argv.push_back(nullptr);
-        auto args = RKMemspreadArgs::initWithArgc(static_cast<int>(arguments.size()), argv.data());
+        std::vector<char*> argv = RKKeptArgv(std::move(arguments));
+        auto args = RKMemspreadArgs::initWithArgc(static_cast<int>(argv.size() - 1), argv.data());
         Keys keys;
         for (const auto& [key, process] : args.value().targetProcessesAndError(error).value_or(RKTargetMap{}))
             if (key != 0 || std::dynamic_pointer_cast<RKKernelProcess>(process)) keys.insert(key);
