@@ -136,10 +136,11 @@ TEST(RKUserProcessFixture, ReportShowsSharedMemoryOnceTheDocumentAgreesAndAllPro
     // The document holds each process's header figure, in pid order, and one shared record of the two.
     const pid_t low = std::min(fixture.pid(), fixture.childPid()), high = std::max(fixture.pid(), fixture.childPid());
     std::string expected;
-    for (const std::string pid : {std::to_string(low), std::to_string(high)}) {
+    for (const pid_t pid : {low, high}) {
         std::smatch figure;
-        ASSERT_TRUE(std::regex_search(report, figure, std::regex("\\[" + pid + "\\]: 64-bit\tMemspread: (-?\\d+) B")));
-        expected += pid + " " + figure[1].str() + "\n";
+        const std::string number = std::to_string(pid);
+        ASSERT_TRUE(std::regex_search(report, figure, std::regex("\\[" + number + "\\]: 64-bit\tMemspread: (-?\\d+) B")));
+        expected += number + " " + figure[1].str() + "\n";
     }
     expected += "shared " + std::to_string(low) + " " + std::to_string(high) + "\n";
     EXPECT_TRUE(parsed.standardOutput.starts_with(expected)) << parsed.standardOutput << "expected:\n" << expected;
