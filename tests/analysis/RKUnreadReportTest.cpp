@@ -5,14 +5,13 @@
 #include <unistd.h>
 
 #include <cstdio>
-#include <fstream>
-#include <sstream>
 
 #include "analysis/RKMemspread.h"
 #include "output/RKOutputFormatterJSON.h"
 #include "output/RKOutputFormatterText.h"
 #include "platform/RKScriptedPlatform.h"
 #include "process/RKAnalysisSettings.h"
+#include "support/RKRunCommand.h"
 
 TEST(RKUnreadReport, ProcessThatCouldNotBeOpenedIsAWarningOfTheRun) {
     auto platform = std::make_shared<RKScriptedPlatform>();
@@ -53,25 +52,23 @@ TEST(RKUnreadReport, ProcessThatCouldNotBeOpenedIsAWarningOfTheRun) {
         json->close();
     }
     std::fclose(file);
-    std::stringstream text, document;
-    text << std::ifstream(textPath).rdbuf();
-    document << std::ifstream(jsonPath).rdbuf();
+    const std::string text = RKFileText(textPath), document = RKFileText(jsonPath);
     std::remove(textPath.c_str());
     std::remove(jsonPath.c_str());
     RKAnalysisSettings::resetCache();
 
-    EXPECT_NE(text.str().find("Warnings were encountered while examining the following processes:\n"
+    EXPECT_NE(text.find("Warnings were encountered while examining the following processes:\n"
                               "\tguard\\x1b]0; [8]: not measured - permission denied\n"
                               "\tstarved [9]: not measured - too many open files\n"),
               std::string::npos)
-        << text.str();
-    EXPECT_NE(text.str().find("tool [7]: 64-bit"), std::string::npos);
-    EXPECT_EQ(text.str().find("guard\\x1b]0; [8]: 64-bit"), std::string::npos) << "not shown as measured";
-    EXPECT_EQ(text.str().find("starved [9]: 64-bit"), std::string::npos) << "not shown as measured";
-    EXPECT_EQ(text.str().find("exited"), std::string::npos) << "gone: not named";
-    EXPECT_NE(document.str().find(R"("warnings":["guard\u001b]0; [8]: not measured - permission denied",)"
+        << text;
+    EXPECT_NE(text.find("tool [7]: 64-bit"), std::string::npos);
+    EXPECT_EQ(text.find("guard\\x1b]0; [8]: 64-bit"), std::string::npos) << "not shown as measured";
+    EXPECT_EQ(text.find("starved [9]: 64-bit"), std::string::npos) << "not shown as measured";
+    EXPECT_EQ(text.find("exited"), std::string::npos) << "gone: not named";
+    EXPECT_NE(document.find(R"("warnings":["guard\u001b]0; [8]: not measured - permission denied",)"
                                   R"("starved [9]: not measured - too many open files"])"),
               std::string::npos)
-        << document.str();
-    EXPECT_EQ(document.str().find(R"("pid":8)"), std::string::npos) << "no process object of its own";
+        << document;
+    EXPECT_EQ(document.find(R"("pid":8)"), std::string::npos) << "no process object of its own";
 }

@@ -35,12 +35,6 @@ RKCommandResult memspread(std::vector<std::string> arguments) {
     return RKRunCommand(arguments);
 }
 
-std::string contents(const std::string& path) {
-    std::stringstream text;
-    text << std::ifstream(path).rdbuf();
-    return text.str();
-}
-
 class RKDriverTest : public ::testing::Test {
 protected:
     void SetUp() override {
@@ -104,10 +98,10 @@ protected:
 
 // Runs every command line of the data file and writes down the answers in the file's own form.
 TEST_F(RKDriverTest, WhatTheCommandLineAloneDecides) {
-    const std::string usage = contents(MEMSPREAD_TEST_DATA "/usage.txt");  // as documented
+    const std::string usage = RKFileText(MEMSPREAD_TEST_DATA "/usage.txt");  // as documented
     std::string expected;
     std::string actual;
-    for (const std::string& line : RKSplitLines(contents(MEMSPREAD_TEST_DATA "/driver-failures.txt"))) {
+    for (const std::string& line : RKSplitLines(RKFileText(MEMSPREAD_TEST_DATA "/driver-failures.txt"))) {
         if (line.empty() || line[0] == '#') continue;
         expected += line + "\n";
         if (line[0] != '$') continue;
@@ -146,7 +140,7 @@ TEST_F(RKDriverTest, FailedStartRemovesEveryNamedOutputFileAndARunReplacesThem) 
         memspread({"-j", json, "--metrilog", metrilog, std::to_string(startSleeper("run")), tag_ + "x"});
     EXPECT_TRUE(found.exitedWith(0)) << found.standardError;
     EXPECT_EQ(found.standardError, "Unable to find pid for process matching '" + tag_ + "x'\n");
-    EXPECT_EQ(contents(json).substr(0, 1), "{") << "a document replaces the stale report";
+    EXPECT_EQ(RKFileText(json).substr(0, 1), "{") << "a document replaces the stale report";
     EXPECT_TRUE(fs::exists(metrilog));
 }
 
@@ -212,7 +206,7 @@ TEST_F(RKDriverTest, AnUnprivilegedUser) {
         EXPECT_EQ(result.standardError, "Must run as root.\n") << arguments.front();
         EXPECT_EQ(result.standardOutput, "") << arguments.front();
     }
-    EXPECT_EQ(contents(json), "stale report\n");
+    EXPECT_EQ(RKFileText(json), "stale report\n");
 
     // Another user's process is left out; without access to its executable its name comes from
     // the kernel's record.

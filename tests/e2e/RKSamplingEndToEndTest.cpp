@@ -7,7 +7,6 @@
 #include <algorithm>
 #include <chrono>
 #include <filesystem>
-#include <fstream>
 #include <iterator>
 #include <regex>
 #include <string>
@@ -47,9 +46,7 @@ size_t countOf(const std::string& text, const std::regex& pattern) {
 
 // Samples finished in the metrics log at `path`, which is written sample by sample.
 size_t samplesIn(const fs::path& path) {
-    std::ifstream file(path);
-    std::string text{std::istreambuf_iterator<char>(file), {}};
-    return countOf(text, std::regex("\"gather_duration\""));
+    return countOf(RKFileText(path), std::regex("\"gather_duration\""));
 }
 
 // Waits until the log holds `count` samples; false after a minute (a loaded machine is slow, not

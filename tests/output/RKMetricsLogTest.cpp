@@ -4,8 +4,6 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <fstream>
-#include <iterator>
 
 #include "model/RKAuxData.h"
 #include "model/RKMemoryCategory.h"
@@ -49,11 +47,6 @@ RKCategoryMap categories(std::initializer_list<std::tuple<std::string, std::stri
 }
 
 RKTime continuousAt(uint64_t nanoseconds) { return RKTime::fromReadings({0, nanoseconds, 978307200, 0}); }
-
-std::string contents(const std::string& path) {
-    std::ifstream file(path);
-    return {std::istreambuf_iterator<char>(file), {}};
-}
 
 struct Log {
     std::shared_ptr<RKScriptedPlatform> platform = std::make_shared<RKScriptedPlatform>();  // wall clock at 0
@@ -129,7 +122,7 @@ TEST(RKMetricsLog, RecordsProcessGroupsAndTheSummaryGroupOfAReport) {
     out.endAtTime(continuousAt(1002500000));
     out.close();
 
-    EXPECT_EQ(contents(log.path),
+    EXPECT_EQ(RKFileText(log.path),
               kHeader + line(1, "total_memory", "B", "4000", "alpha", R"("labels":{"pid":"10"},"tags":["summary"])") +
                   line(1, "heap /h", "B", "3024", "alpha") + line(1, "stack", "B", "976", "alpha") +
                   line(1, "aux_data.kernel.page_table", "B", "-8", "alpha", kContext) +

@@ -3,7 +3,6 @@
 // support). The sums are checked against the captured meminfo, recounted here line by line.
 #include <gtest/gtest.h>
 
-#include <fstream>
 #include <set>
 #include <sstream>
 
@@ -13,16 +12,13 @@
 #include "platform/RKModulesParser.h"
 #include "platform/RKSlabinfoParser.h"
 #include "platform/RKVmallocinfoParser.h"
+#include "support/RKRunCommand.h"
 
 namespace {
 
 constexpr uint64_t P = 4096;
 
-std::string captured(const char* name) {
-    std::stringstream text;
-    text << std::ifstream(std::string(MEMSPREAD_TEST_DATA "/kernel/") + name).rdbuf();
-    return text.str();
-}
+std::string captured(const char* name) { return RKFileText(std::string(MEMSPREAD_TEST_DATA "/kernel/") + name); }
 
 std::string nameOf(const char (&name)[RK_ZONE_NAME_MAX]) { return std::string(name, strnlen(name, RK_ZONE_NAME_MAX)); }
 

@@ -3,19 +3,12 @@
 // format: the generic lines, then the buffer's).
 #include <gtest/gtest.h>
 
-#include <fstream>
-#include <sstream>
 #include <tuple>
 
 #include "platform/RKOwnedObjectParsers.h"
+#include "support/RKRunCommand.h"
 
 namespace {
-
-std::string testData(const char* name) {
-    std::stringstream text;
-    text << std::ifstream(std::string(MEMSPREAD_TEST_DATA "/") + name).rdbuf();
-    return text.str();
-}
 
 // Every field of a segment, so that a mismatch prints them all.
 auto fields(const RKSysVSegment& s) { return std::tuple(s.shmid, s.size, s.creator, s.attached, s.resident, s.swapped); }
@@ -23,7 +16,7 @@ auto fields(const RKSysVSegment& s) { return std::tuple(s.shmid, s.size, s.creat
 }  // namespace
 
 TEST(RKOwnedObjectParsersTest, SysVSegmentsAndDmaBufsAreReadFromTheKernelsTexts) {
-    std::vector<RKSysVSegment> segments = RKParseSysVShm(testData("sysvipc-shm.txt"));
+    std::vector<RKSysVSegment> segments = RKParseSysVShm(RKFileText(MEMSPREAD_TEST_DATA "/sysvipc-shm.txt"));
     ASSERT_EQ(segments.size(), 1u);
     EXPECT_EQ(fields(segments[0]), fields({62, 8388608, 7938, 0, 8388608, 0}));
 
@@ -35,7 +28,7 @@ TEST(RKOwnedObjectParsersTest, SysVSegmentsAndDmaBufsAreReadFromTheKernelsTexts)
     EXPECT_TRUE(RKParseSysVShm("key shmid perms size cpid lpid nattch\n0 7 600 4096 100 100 0\n").empty());
 
     // A dma-buf's fdinfo gives its size, inode and exporter.
-    auto info = RKParseDmaBufFdinfo(testData("fdinfo-dmabuf.txt"));
+    auto info = RKParseDmaBufFdinfo(RKFileText(MEMSPREAD_TEST_DATA "/fdinfo-dmabuf.txt"));
     ASSERT_TRUE(info);
     EXPECT_EQ(std::tie(info->size, info->inode, info->exporter), std::tuple(8294400u, 2051u, "system"));
     // Not a dma-buf (an ordinary file's fdinfo), or no inode line: nothing.
