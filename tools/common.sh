@@ -6,7 +6,8 @@ memspread_packages=(cmake g++ make libbsd-dev libgtest-dev libgmock-dev libbench
 memspread_packages+=(dpkg-dev file groff-base bash-completion)
 # The fuzzers build with clang and its libFuzzer.
 memspread_packages+=(clang libfuzzer-14-dev libclang-rt-14-dev)
-# Snapshot files: a JSON parser, and zstd compression.
+# Snapshot files: a JSON parser, and zstd compression. The parser also judges the JSON strings
+# fuzzer's output.
 memspread_packages+=(nlohmann-json3-dev libzstd-dev)
 
 # Installs the packages that are missing. apt-get runs only when something is missing, so a

@@ -4,6 +4,7 @@
 
 #include "model/RKAssert.h"
 #include "model/RKAuxData.h"
+#include "model/RKEscapedText.h"
 #include "model/RKMemoryCategory.h"
 #include "model/RKProcessGroup.h"
 #include "model/RKTime.h"
@@ -78,8 +79,8 @@ void RKOutputFormatterText::_printCategories(const RKCategoryMap& categories) {
             formattedStringForSize(static_cast<int64_t>(category.totalWiredSize())),
         };
         row.regions = category.totalRegions();
-        row.name = RKTextEscaped(name.empty() ? *key : name);
-        row.detail = RKTextEscaped(_truncatedNameForString(category.detailedName()));
+        row.name = RKEscapedText(name.empty() ? *key : name);
+        row.detail = RKEscapedText(_truncatedNameForString(category.detailedName()));
         table_.printRow(output_, row);
     }
 }
@@ -108,7 +109,7 @@ void RKOutputFormatterText::_printAuxData(const RKAuxDataMap& auxData, int inden
     for (const auto& [key, node] : auxData.entries()) {
         if (!node) continue;
         for (int level = 0; level < indent; ++level) std::fputc('\t', output_);
-        const std::string name = RKTextEscaped(key);
+        const std::string name = RKEscapedText(key);
         if (node->isContainer()) {
             std::fprintf(output_, "%s:\n", name.c_str());
             _printAuxData(static_cast<const RKAuxDataMap&>(*node), indent + 1);
@@ -125,7 +126,7 @@ void RKOutputFormatterText::_printPhysMemspreadBreakdownEnabled() {
 
 void RKOutputFormatterText::_printMessages(const char* heading, const std::vector<std::string>& messages) {
     std::fputs(heading, output_);
-    for (const std::string& message : messages) std::fprintf(output_, "\t%s\n", RKTextEscaped(message).c_str());
+    for (const std::string& message : messages) std::fprintf(output_, "\t%s\n", RKEscapedText(message).c_str());
 }
 
 // ---- One report ----
@@ -144,7 +145,7 @@ void RKOutputFormatterText::printProcessHeader(const RKProcess& process) {
     if (processCount_ < 2) ++processCount_;
     pageSize_ = process.pageSize();
     table_.printSeparator(output_, false);
-    std::fprintf(output_, "%s: %s-bit%s", RKTextEscaped(process.displayString()).c_str(),
+    std::fprintf(output_, "%s: %s-bit%s", RKEscapedText(process.displayString()).c_str(),
                  process.is64bit() ? "64" : "32", process.isTranslated() ? " (translated)" : "");
     if (!process.warnings().empty()) {
         _printMessages("\nWarnings were encountered while examining the process.\n", process.warnings());
@@ -178,7 +179,7 @@ void RKOutputFormatterText::_printSharingLine(const RKProcessGroup& group, const
         if (!member || member->isEqual(process)) continue;
         if (!first) line += ',';
         line += ' ';
-        line += RKTextEscaped(member->displayString());
+        line += RKEscapedText(member->displayString());
         first = false;
     }
     std::fprintf(output_, "%s:\n", line.c_str());

@@ -1,9 +1,5 @@
 #include "output/RKTextNames.h"
 
-#include "model/RKEscapedText.h"
-
-std::string RKTextEscaped(std::string_view text) { return RKEscapedText(text); }
-
 std::string RKTextTruncatedName(std::string_view name, bool wide) {
     const size_t last = name.find_last_not_of('/');
     if (wide || last == std::string_view::npos) return std::string(name);

@@ -2,6 +2,7 @@
 
 #include <cinttypes>
 
+#include "model/RKEscapedText.h"
 #include "model/RKMemoryRegion.h"
 #include "output/RKTextNames.h"
 #include "output/RKTextSettings.h"
@@ -45,8 +46,8 @@ void printRegion(FILE* output, const RKMemoryRegion& region, uint64_t pageSize, 
     std::fprintf(output, " %7" PRIu64 " %7" PRIu64, pages(region.cleanNonSpecSize), pages(region.reclaimableSize));
     if (columns.wired) std::fprintf(output, " %7" PRIu64, pages(region.wiredSize()));
 
-    const std::string detail = RKTextEscaped(RKTextTruncatedName(region.detailedName, columns.wide));
-    std::fprintf(output, "   %s%s%s\n", RKTextEscaped(region.name).c_str(), detail.empty() ? "" : " ", detail.c_str());
+    const std::string detail = RKEscapedText(RKTextTruncatedName(region.detailedName, columns.wide));
+    std::fprintf(output, "   %s%s%s\n", RKEscapedText(region.name).c_str(), detail.empty() ? "" : " ", detail.c_str());
 }
 
 }  // namespace
@@ -54,7 +55,7 @@ void printRegion(FILE* output, const RKMemoryRegion& region, uint64_t pageSize, 
 void RKTextPrintRegionListing(FILE* output, const RKProcess& process, const RKRegionList& regions, int64_t options) {
     const Columns columns{(options & RKTextOptionSwapped) != 0, (options & RKTextOptionWired) != 0,
                           (options & RKTextOptionWide) != 0};
-    std::fprintf(output, "%s\n\n", RKTextEscaped(process.displayString()).c_str());
+    std::fprintf(output, "%s\n\n", RKEscapedText(process.displayString()).c_str());
     printHeader(output, columns);
     for (const auto& region : regions) {
         if (region) printRegion(output, *region, process.pageSize(), columns);

@@ -19,18 +19,15 @@ constexpr uint64_t P = 4096;
 
 RKMemoryInfoRecord counterRecord(std::string_view name, uint64_t value) {
     RKMemoryInfoRecord record;
-    record.flags = VM_KERN_SITE_COUNTER;
-    record.site = static_cast<uint64_t>(
-        std::find(RKLinuxKernelCounters.begin(), RKLinuxKernelCounters.end(), name) - RKLinuxKernelCounters.begin());
-    record.mapped = value;
+    record.flags = VM_KERN_SITE_COUNTER, record.mapped = value;
+    record.site = uint64_t(std::find(RKLinuxKernelCounters.begin(), RKLinuxKernelCounters.end(), name) -
+                           RKLinuxKernelCounters.begin());
     return record;
 }
 
 RKMemoryInfoRecord tagRecord(uint64_t tag, uint64_t size) {
     RKMemoryInfoRecord record;
-    record.flags = VM_KERN_SITE_TAG | VM_KERN_SITE_WIRED;
-    record.site = tag;
-    record.size = size;
+    record.flags = VM_KERN_SITE_TAG | VM_KERN_SITE_WIRED, record.site = tag, record.size = size;
     return record;
 }
 
@@ -46,20 +43,16 @@ protected:
         platform->addProcess(0, "kernel", 0, PROC_FLAG_SYSTEM);
         RKScriptedProcess& tool = platform->addProcess(7, "tool");
         RKScriptedRegion anonymous;
-        anonymous.start = 0x10000;
-        anonymous.size = 2 * P;
-        anonymous.info.pages_resident = 2;
-        anonymous.info.pages_dirtied = 2;
-        anonymous.info.share_mode = SM_PRIVATE;
-        anonymous.info.object_id_full = 0x4000000000010000ull;
+        anonymous.start = 0x10000, anonymous.size = 2 * P;
+        anonymous.info = {.pages_resident = 2, .pages_dirtied = 2, .share_mode = SM_PRIVATE,
+                          .object_id_full = 0x4000000000010000ull};
         tool.regions = {anonymous};
         tool.ledgerBalances = {static_cast<int64_t>(P)};
         platform->selfRegionValue = 1;  // the breakdown: processes are charged their page tables
 
         RKKernelMemoryInfo& kernel = platform->kernelMemory;
-        RKZoneName name{};
-        std::strcpy(name.mzn_name, "dentry");
-        kernel.zoneNames = {name};
+        kernel.zoneNames = {RKZoneName{}};
+        std::strcpy(kernel.zoneNames[0].mzn_name, "dentry");
         kernel.zones = {RKZoneInfo{.mzi_cur_size = 10000, .mzi_collectable = 1}};
         kernel.sites = {tagRecord(RKKernelTagPageTables, 2 * P), tagRecord(RKKernelTagUserWired, P)};
         const std::pair<const char*, uint64_t> counters[] = {

@@ -11,6 +11,7 @@
 #include "driver/RKSampler.h"
 #include "platform/RKScriptedPlatform.h"
 #include "support/RKKeptArgv.h"
+#include "support/RKRecordingFormatter.h"
 
 namespace {
 
@@ -28,7 +29,7 @@ RKMemspreadArgs argsFor(std::vector<std::string> arguments) {
 
 // Counts the reports it is given. Closed, it holds the first report back until opened, so that the
 // sample stays in analysis while the next ones are gathered.
-class GatedFormatter : public RKOutputFormatter {
+class GatedFormatter : public RKRecordingFormatter {
 public:
     explicit GatedFormatter(bool open) : open_(open) {}
     void open() {
@@ -40,9 +41,7 @@ public:
         std::lock_guard<std::mutex> lock(mutex_);
         return reports_;
     }
-
-    const char* className() const override { return "GatedFormatter"; }
-    bool implementsStartAtTime() const override { return true; }
+    bool implementsPrintSpanlistLikeOutput() const override { return false; }
     void startAtTime(const RKTime&) override {
         std::unique_lock<std::mutex> lock(mutex_);
         changed_.wait(lock, [this] { return open_; });
@@ -51,23 +50,21 @@ public:
         std::lock_guard<std::mutex> lock(mutex_);
         reports_++;
     }
-    void printProcessHeader(const RKProcess&) override {}
-    void endProcessHeader(const RKProcess&) override {}
-    void printProcessTotal(uint64_t, const RKProcess&) override {}
-    void printProcessCategories(const RKCategoryMap&, const RKMemoryTotal&) override {}
-    void printSharedCategories(const RKCategoryMap&, const RKProcessGroup&, const RKProcess&, bool,
-                               const RKMemoryTotal&) override {}
-    void printProcessAuxData(const std::shared_ptr<RKAuxDataMap>&) override {}
-    void printProcessesWithWarnings(const RKProcessList&, const RKProcessList&,
-                                    const std::vector<std::string>&) override {}
-    void printSummaryCategories(const RKCategoryMap&, const RKMemoryTotal&, bool) override {}
-    void printGlobalAuxData(const std::shared_ptr<RKAuxDataMap>&) override {}
 
 private:
     std::mutex mutex_;
     std::condition_variable changed_;
     bool open_;
     size_t reports_ = 0;
+};
+
+// Samples `args` on `platform` into a GatedFormatter, open or closed.
+struct Sampling {
+    std::shared_ptr<RKScriptedPlatform> platform = std::make_shared<RKScriptedPlatform>();
+    RKScopedPlatform scope{platform};
+    std::shared_ptr<GatedFormatter> formatter;
+    RKOutputFormatterList formatters;
+    explicit Sampling(bool open) : formatter(std::make_shared<GatedFormatter>(open)), formatters{formatter} {}
 };
 
 void waitForSamples(const RKSampler& sampler, uint64_t count) {
@@ -88,18 +85,15 @@ TEST(RKSampleInterval, ForgivesTheFirstOverrunThenGrowsByTheOvershootAndNeverShr
 }
 
 TEST(RKSampler, SlowSamplesStretchTheIntervalOnceWithAWarning) {
-    auto platform = std::make_shared<RKScriptedPlatform>();
-    RKScriptedProcess& slow = platform->addProcess(100, "slow");
+    Sampling s(true);
+    RKScriptedProcess& slow = s.platform->addProcess(100, "slow");
     slow.walkNanoseconds = 5 * kSecond / 2;
     slow.physMemspreadGrowth = 4096;  // never carried over: every sample gathers it
-    RKScopedPlatform scope(platform);
     RKMemspreadArgs args = argsFor({"--sample", "1", "100"});
-    auto formatter = std::make_shared<GatedFormatter>(true);
-    RKOutputFormatterList formatters{formatter};
 
     testing::internal::CaptureStderr();
     {
-        RKSampler sampler(args, formatters);
+        RKSampler sampler(args, s.formatters);
         sampler.start();
         waitForSamples(sampler, 5);
         sampler.stop();
@@ -108,34 +102,31 @@ TEST(RKSampler, SlowSamplesStretchTheIntervalOnceWithAWarning) {
     const std::string messages = testing::internal::GetCapturedStderr();
     EXPECT_EQ(std::regex_replace(messages, std::regex("(Unable to analyze|mach_).*\n"), ""),
               "WARNING: Unable to keep up with sampling interval. Increasing interval to 2.65s.\n\nStopping...\n");
-    EXPECT_GE(formatter->reports(), 5u);
-    EXPECT_GE(platform->callCount("regionRecurse 100"), 5u);
+    EXPECT_GE(s.formatter->reports(), 5u);
+    EXPECT_GE(s.platform->callCount("regionRecurse 100"), 5u);
 }
 
 TEST(RKSampler, AnUnchangedProcessIsCarriedOverWhileItsSampleIsStillInAnalysis) {
-    auto platform = std::make_shared<RKScriptedPlatform>();
-    platform->addProcess(100, "lowest");  // never carried over: a cancelled gather writes into it
-    platform->addProcess(200, "steady");
-    platform->addProcess(300, "growing").physMemspreadGrowth = 4096;
-    RKScopedPlatform scope(platform);
+    Sampling s(false);
+    s.platform->addProcess(100, "lowest");  // never carried over: a cancelled gather writes into it
+    s.platform->addProcess(200, "steady");
+    s.platform->addProcess(300, "growing").physMemspreadGrowth = 4096;
     RKMemspreadArgs args = argsFor({"--sample", "0.5", "100", "200", "300"});
-    auto formatter = std::make_shared<GatedFormatter>(false);
-    RKOutputFormatterList formatters{formatter};
 
     testing::internal::CaptureStderr();  // "Stopping..."
-    RKSampler sampler(args, formatters);
+    RKSampler sampler(args, s.formatters);
     sampler.start();
     waitForSamples(sampler, 3);  // the first is held in analysis; two more wait behind it
     // Stopping waits for the tick in progress, which may be waiting for room in the queue. The
     // held sample is let go only once no further tick can start, or one might gather afresh.
     std::thread stopper([&] { sampler.stop(); });
     while (!sampler.stopRequested()) std::this_thread::sleep_for(std::chrono::milliseconds(1));
-    formatter->open();
+    s.formatter->open();
     stopper.join();
     sampler.drain();
     testing::internal::GetCapturedStderr();
-    EXPECT_GE(formatter->reports(), 3u);
-    EXPECT_EQ(platform->callCount("regionRecurse 200"), 1u);
-    EXPECT_GE(platform->callCount("regionRecurse 100"), 3u);
-    EXPECT_GE(platform->callCount("regionRecurse 300"), 3u);
+    EXPECT_GE(s.formatter->reports(), 3u);
+    EXPECT_EQ(s.platform->callCount("regionRecurse 200"), 1u);
+    EXPECT_GE(s.platform->callCount("regionRecurse 100"), 3u);
+    EXPECT_GE(s.platform->callCount("regionRecurse 300"), 3u);
 }

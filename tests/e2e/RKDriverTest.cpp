@@ -18,6 +18,7 @@
 #include "driver/RKMemspreadArgs.h"
 #include "platform/RKLinuxPlatform.h"
 #include "process/RKKernelProcess.h"
+#include "support/RKKeptArgv.h"
 #include "support/RKRunCommand.h"
 #include "support/RKUnprivileged.h"
 
@@ -32,12 +33,6 @@ const std::string kNoTarget =
 RKCommandResult memspread(std::vector<std::string> arguments) {
     arguments.insert(arguments.begin(), MEMSPREAD_BINARY);
     return RKRunCommand(arguments);
-}
-
-std::string contents(const std::string& path) {
-    std::stringstream text;
-    text << std::ifstream(path).rdbuf();
-    return text.str();
 }
 
 class RKDriverTest : public ::testing::Test {
@@ -86,11 +81,8 @@ protected:
     // Resolves a command line (without the program name) in this process, on the real /proc.
     Keys resolve(std::vector<std::string> arguments, RKError* error = nullptr) {
         RKScopedPlatform scope(std::make_shared<RKLinuxPlatform>());
-        arguments.insert(arguments.begin(), "memspread");
-        std::vector<char*> argv;
-        for (auto& argument : arguments) argv.push_back(argument.data());
-        argv.push_back(nullptr);
-        auto args = RKMemspreadArgs::initWithArgc(static_cast<int>(arguments.size()), argv.data());
+        std::vector<char*> argv = RKKeptArgv(std::move(arguments));
+        auto args = RKMemspreadArgs::initWithArgc(static_cast<int>(argv.size() - 1), argv.data());
         Keys keys;
         for (const auto& [key, process] : args.value().targetProcessesAndError(error).value_or(RKTargetMap{}))
             if (key != 0 || std::dynamic_pointer_cast<RKKernelProcess>(process)) keys.insert(key);
@@ -106,10 +98,10 @@ protected:
 
 // Runs every command line of the data file and writes down the answers in the file's own form.
 TEST_F(RKDriverTest, WhatTheCommandLineAloneDecides) {
-    const std::string usage = contents(MEMSPREAD_TEST_DATA "/usage.txt");  // as documented
+    const std::string usage = RKFileText(MEMSPREAD_TEST_DATA "/usage.txt");  // as documented
     std::string expected;
     std::string actual;
-    for (const std::string& line : RKSplitLines(contents(MEMSPREAD_TEST_DATA "/driver-failures.txt"))) {
+    for (const std::string& line : RKSplitLines(RKFileText(MEMSPREAD_TEST_DATA "/driver-failures.txt"))) {
         if (line.empty() || line[0] == '#') continue;
         expected += line + "\n";
         if (line[0] != '$') continue;
@@ -148,7 +140,7 @@ TEST_F(RKDriverTest, FailedStartRemovesEveryNamedOutputFileAndARunReplacesThem) 
         memspread({"-j", json, "--metrilog", metrilog, std::to_string(startSleeper("run")), tag_ + "x"});
     EXPECT_TRUE(found.exitedWith(0)) << found.standardError;
     EXPECT_EQ(found.standardError, "Unable to find pid for process matching '" + tag_ + "x'\n");
-    EXPECT_EQ(contents(json).substr(0, 1), "{") << "a document replaces the stale report";
+    EXPECT_EQ(RKFileText(json).substr(0, 1), "{") << "a document replaces the stale report";
     EXPECT_TRUE(fs::exists(metrilog));
 }
 
@@ -214,7 +206,7 @@ TEST_F(RKDriverTest, AnUnprivilegedUser) {
         EXPECT_EQ(result.standardError, "Must run as root.\n") << arguments.front();
         EXPECT_EQ(result.standardOutput, "") << arguments.front();
     }
-    EXPECT_EQ(contents(json), "stale report\n");
+    EXPECT_EQ(RKFileText(json), "stale report\n");
 
     // Another user's process is left out; without access to its executable its name comes from
     // the kernel's record.

@@ -11,6 +11,7 @@
 #include <cstring>
 #include <fstream>
 #include <regex>
+#include <tuple>
 
 #include "model/RKMemoryRegion.h"
 #include "process/RKAnalysisSettings.h"
@@ -88,12 +89,10 @@ TEST_F(RKOwnedMemoryFixtureTest, HeldMemoryIsOwnedAndPrivateShmemIsDirty) {
     // Everything the kernel counts for its mappings, plus what it holds: a page per object.
     EXPECT_NEAR(static_cast<double>(memspread), static_cast<double>(kernel + heldUnmapped()), 4.0 * P);
 
-    const uint64_t privateMemfd = fixture.area("private_memfd")->address;
     for (const auto& region : *process->memoryRegions()) {
-        if (region->start != privateMemfd) continue;
-        EXPECT_EQ(region->name, "memfd");
-        EXPECT_EQ(region->dirtySize, 8 * MiB) << "shmem pages, not clean page cache";
-        EXPECT_EQ(region->cleanNonSpecSize, 0u);
+        if (region->start != fixture.area("private_memfd")->address) continue;
+        EXPECT_EQ(std::tuple(region->name, region->dirtySize, region->cleanNonSpecSize), std::tuple("memfd", 8 * MiB, 0u))
+            << "shmem pages, not clean page cache";
     }
 }
 
@@ -123,24 +122,18 @@ TEST_F(RKOwnedMemoryFixtureTest, MapperSharesTheHeldMemfdAndUnmappedFindsIt) {
 
 // A segment whose creator is gone and that nobody maps is held by no process: the report says so.
 TEST_F(RKOwnedMemoryFixtureTest, SegmentOfAGoneCreatorIsAWarningOfTheReport) {
-    int ids[2];
-    ASSERT_EQ(pipe(ids), 0);
-    pid_t creator = fork();
+    const key_t key = 0x52000000 | getpid();
+    const pid_t creator = fork();
     if (creator == 0) {
-        int shmid = shmget(IPC_PRIVATE, MiB, IPC_CREAT | 0600);
-        void* p = shmid < 0 ? reinterpret_cast<void*>(-1) : shmat(shmid, nullptr, 0);
-        if (p != reinterpret_cast<void*>(-1)) {
-            std::memset(p, 1, MiB);
-            shmdt(p);
-        }
-        _exit(write(ids[1], &shmid, sizeof shmid) == sizeof shmid ? 0 : 1);
+        void* p = shmat(shmget(key, MiB, IPC_CREAT | IPC_EXCL | 0600), nullptr, 0);
+        if (p == reinterpret_cast<void*>(-1)) _exit(1);
+        std::memset(p, 1, MiB);
+        _exit(shmdt(p) == 0 ? 0 : 1);
     }
-    int shmid = -1;
-    ASSERT_EQ(read(ids[0], &shmid, sizeof shmid), static_cast<ssize_t>(sizeof shmid));
-    close(ids[0]);
-    close(ids[1]);
-    waitpid(creator, nullptr, 0);
-    ASSERT_GE(shmid, 0);
+    int status = 0;
+    waitpid(creator, &status, 0);
+    const int shmid = shmget(key, 0, 0);
+    ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0 && shmid >= 0);
 
     RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", std::to_string(fixture.pid())});
     shmctl(shmid, IPC_RMID, nullptr);

@@ -7,7 +7,6 @@
 #include <algorithm>
 #include <chrono>
 #include <filesystem>
-#include <fstream>
 #include <iterator>
 #include <regex>
 #include <string>
@@ -45,14 +44,9 @@ size_t countOf(const std::string& text, const std::regex& pattern) {
     return static_cast<size_t>(std::distance(std::sregex_iterator(text.begin(), text.end(), pattern), {}));
 }
 
-// The text after the last "Time:" line: the last sample's report.
-std::string lastSample(const std::string& text) { return text.substr(text.rfind("Time: ")); }
-
 // Samples finished in the metrics log at `path`, which is written sample by sample.
 size_t samplesIn(const fs::path& path) {
-    std::ifstream file(path);
-    std::string text{std::istreambuf_iterator<char>(file), {}};
-    return countOf(text, std::regex("\"gather_duration\""));
+    return countOf(RKFileText(path), std::regex("\"gather_duration\""));
 }
 
 // Waits until the log holds `count` samples; false after a minute (a loaded machine is slow, not
@@ -96,7 +90,8 @@ TEST(RKSamplingEndToEnd, StopsOnSigintWithTheSameSamplesInEveryOutputAndDropsAnE
               1u)
         << run.standardError;
     EXPECT_NE(run.standardOutput.find("[" + gone + "]:"), std::string::npos) << "measured before it left";
-    EXPECT_EQ(lastSample(run.standardOutput).find("[" + gone + "]"), std::string::npos);
+    EXPECT_EQ(run.standardOutput.substr(run.standardOutput.rfind("Time: ")).find("[" + gone + "]"), std::string::npos)
+        << "measured in the last sample";
 
     // One text report, one JSON sample, one summary total and one duration per sample.
     const size_t samples = countOf(run.standardOutput, std::regex("(^|\n)Time: "));

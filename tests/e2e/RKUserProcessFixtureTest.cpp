@@ -1,11 +1,13 @@
 // A live process measured end to end: the fixture maps one area of each kind and forks a child
 // that shares the shared kinds. Gathered in this process, each area must come out as a region of
 // the right name, detail, share mode, identity and size; through the binary, the report must
-// show the shared kinds once, in the block of memory the two processes share.
+// show the shared kinds once, in the block of memory the two processes share, and the JSON
+// document of the same run must parse and agree with it.
 #include <gtest/gtest.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <filesystem>
 #include <map>
 #include <regex>
 
@@ -40,6 +42,14 @@ std::map<std::string, uint64_t> dirtyByCategory(const std::string& report, const
     }
     return rows;
 }
+
+// Prints "PID MEMSPREAD" per process object in pid order, then "shared PID PID..." per shared
+// record, its pids in order.
+const char* kSummarizeDocument = R"(import json, sys
+document = json.load(open(sys.argv[1], encoding="utf-8"))
+for process in sorted(document["processes"], key=lambda p: p["pid"]): print(process["pid"], process.get("memspread"))
+for record in document["shared"]: print("shared", *sorted(record["pids"]))
+)";
 
 }  // namespace
 
@@ -95,12 +105,16 @@ TEST(RKUserProcessFixture, EveryKindOfMappingBecomesItsRegion) {
     EXPECT_TRUE(std::ranges::any_of(*parent->memoryRegions(), [](const auto& r) { return r->name == "stack"; }));
 }
 
-TEST(RKUserProcessFixture, ReportShowsSharedMemoryOnceAndAllProcessesUnderAll) {
+TEST(RKUserProcessFixture, ReportShowsSharedMemoryOnceTheDocumentAgreesAndAllProcessesUnderAll) {
     RKFixtureProcess fixture;
     ASSERT_TRUE(fixture.start(MEMSPREAD_FIXTURE)) << fixture.error();
     const std::string parent = std::to_string(fixture.pid()), child = std::to_string(fixture.childPid());
-    RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", parent, child});
+    const auto document = std::filesystem::temp_directory_path() / ("rkfixture-" + parent + ".json");
+    RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", "-j", document.string(), parent, child});
+    RKCommandResult parsed = RKRunCommand({"python3", "-c", kSummarizeDocument, document.string()});
+    std::filesystem::remove(document);
     ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
+    ASSERT_TRUE(parsed.exitedWith(0)) << "the document does not parse: " << parsed.standardError;
     const std::string& report = run.standardOutput;
     const std::map<std::string, uint64_t> sharedKinds = {
         {"memfd", 32 * P}, {"shared anonymous", 16 * P}, {"SysV shared memory", 16 * P}};
@@ -118,6 +132,18 @@ TEST(RKUserProcessFixture, ReportShowsSharedMemoryOnceAndAllProcessesUnderAll) {
         once += own["TOTAL"];
     }
     EXPECT_EQ(summary["TOTAL"], once) << report;
+
+    // The document holds each process's header figure, in pid order, and one shared record of the two.
+    const pid_t low = std::min(fixture.pid(), fixture.childPid()), high = std::max(fixture.pid(), fixture.childPid());
+    std::string expected;
+    for (const pid_t pid : {low, high}) {
+        std::smatch figure;
+        const std::string number = std::to_string(pid);
+        ASSERT_TRUE(std::regex_search(report, figure, std::regex("\\[" + number + "\\]: 64-bit\tMemspread: (-?\\d+) B")));
+        expected += number + " " + figure[1].str() + "\n";
+    }
+    expected += "shared " + std::to_string(low) + " " + std::to_string(high) + "\n";
+    EXPECT_TRUE(parsed.standardOutput.starts_with(expected)) << parsed.standardOutput << "expected:\n" << expected;
 
     // As root, -a reports every process: these among them, and the kernel.
     if (geteuid() != 0) GTEST_SKIP() << "-a needs root";

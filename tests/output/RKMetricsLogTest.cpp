@@ -4,8 +4,6 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <fstream>
-#include <iterator>
 
 #include "model/RKAuxData.h"
 #include "model/RKMemoryCategory.h"
@@ -50,11 +48,6 @@ RKCategoryMap categories(std::initializer_list<std::tuple<std::string, std::stri
 
 RKTime continuousAt(uint64_t nanoseconds) { return RKTime::fromReadings({0, nanoseconds, 978307200, 0}); }
 
-std::string contents(const std::string& path) {
-    std::ifstream file(path);
-    return {std::istreambuf_iterator<char>(file), {}};
-}
-
 struct Log {
     std::shared_ptr<RKScriptedPlatform> platform = std::make_shared<RKScriptedPlatform>();  // wall clock at 0
     RKScopedPlatform scope{platform};
@@ -87,10 +80,14 @@ const std::string kSummary = R"("labels":{},"tags":["summary"])";
 
 // A process whose own and shared memory both hold "heap /h" records it once, summed; shared
 // memory before any own memory is not recorded; a process with errors records its aux data under
-// its own name; a summary without aux data records one "aux_data" of 0; 2.5 ms are 2 ms.
+// its own name; a summary without aux data records one "aux_data" of 0; 2.5 ms are 2 ms. A log
+// that cannot be opened is refused with the system's reason.
 TEST(RKMetricsLog, RecordsProcessGroupsAndTheSummaryGroupOfAReport) {
     Log log;
     ASSERT_TRUE(log.formatter) << log.path;
+    testing::internal::CaptureStderr();
+    EXPECT_EQ(RKOutputFormatterMetrilog::initWithPath("/nonexistent-directory/log.mlj"), nullptr);
+    EXPECT_EQ(testing::internal::GetCapturedStderr(), "Unable to open mlwriter: No such file or directory\n");
     RKOutputFormatterMetrilog& out = *log.formatter;
     auto alpha = process(10, "alpha"), beta = process(20, "beta"), failed = process(30, "failed");
     failed->errors_ = {"failed [30]: task_for_pid failed"};
@@ -125,7 +122,7 @@ TEST(RKMetricsLog, RecordsProcessGroupsAndTheSummaryGroupOfAReport) {
     out.endAtTime(continuousAt(1002500000));
     out.close();
 
-    EXPECT_EQ(contents(log.path),
+    EXPECT_EQ(RKFileText(log.path),
               kHeader + line(1, "total_memory", "B", "4000", "alpha", R"("labels":{"pid":"10"},"tags":["summary"])") +
                   line(1, "heap /h", "B", "3024", "alpha") + line(1, "stack", "B", "976", "alpha") +
                   line(1, "aux_data.kernel.page_table", "B", "-8", "alpha", kContext) +
@@ -166,12 +163,4 @@ print(len(records), durations, records[1]["variables"]["process"])
     RKCommandResult parsed = RKRunCommand({"python3", "-c", check, log.path});
     EXPECT_TRUE(parsed.exitedWith(0)) << parsed.standardError;
     EXPECT_EQ(parsed.standardOutput, "13 [2, 4] q\"b\\n\nt\tc\x01 caf\xc3\xa9 bad\xef\xbf\xbd\xef\xbf\xbd\n");
-}
-
-TEST(RKMetricsLog, AnUnopenableLogIsRefusedWithTheSystemsReason) {
-    auto platform = std::make_shared<RKScriptedPlatform>();
-    RKScopedPlatform scope(platform);
-    testing::internal::CaptureStderr();
-    EXPECT_EQ(RKOutputFormatterMetrilog::initWithPath("/nonexistent-directory/log.mlj"), nullptr);
-    EXPECT_EQ(testing::internal::GetCapturedStderr(), "Unable to open mlwriter: No such file or directory\n");
 }

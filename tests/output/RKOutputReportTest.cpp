@@ -7,9 +7,7 @@
 
 #include <cstdio>
 #include <cstdlib>
-#include <fstream>
 #include <functional>
-#include <iterator>
 #include <limits>
 #include <regex>
 #include <string>
@@ -28,6 +26,7 @@
 #include "output/RKTextDate.h"
 #include "platform/RKScriptedPlatform.h"
 #include "process/RKAnalysisSettings.h"
+#include "support/RKRunCommand.h"
 
 namespace {
 
@@ -248,11 +247,6 @@ void reportCrowd(RKOutputFormatter& out) {
 
 using Report = std::function<void(RKOutputFormatter&)>;
 
-std::string contents(const std::string& path) {
-    std::ifstream file(path);
-    return {std::istreambuf_iterator<char>(file), {}};
-}
-
 constexpr int64_t kJson = -1;
 
 // What the formatter for `format` (a text size format, or kJson) writes for the report. A JSON
@@ -271,7 +265,7 @@ std::string written(const Report& report, int64_t format, int64_t options = 0, c
         report(text);
         std::fclose(file);
     }
-    std::string text = contents(path);
+    std::string text = RKFileText(path);
     std::remove(path.c_str());
     return text;
 }
@@ -304,7 +298,7 @@ TEST(RKOutputReport, MatchesGoldenFiles) {
         platform->pageSize = 65536;
         RKScopedPlatform scope(platform);
         RKAnalysisSettings::resetCache();
-        std::string golden = contents(std::string(MEMSPREAD_TEST_DATA) + "/golden/" + name);
+        std::string golden = RKFileText(std::string(MEMSPREAD_TEST_DATA) + "/golden/" + name);
         if (format == kJson) golden = std::regex_replace(golden, std::regex("\n *"), "");
         EXPECT_EQ(written(report, format, options), golden);
     }

@@ -10,11 +10,11 @@
 #include <algorithm>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 
 #include "platform/RKLinuxPlatform.h"
 #include "platform/RKLinuxVmaClassifier.h"
 #include "support/RKFixtureProcess.h"
+#include "support/RKRunCommand.h"
 
 namespace {
 
@@ -141,9 +141,8 @@ TEST(RKLinuxWalkFakeTree, SmapsIsReadOnceAWalkAndAProcessGoneMidReadEndsItsWalkA
     const std::filesystem::path root(pattern);
     std::filesystem::create_directory(root / "77");
     auto write = [&](const char* name, const std::string& text) { std::ofstream(root / "77" / name) << text; };
-    std::stringstream capture;
-    capture << std::ifstream(std::string(MEMSPREAD_TEST_DATA) + "/smaps-fixture.txt").rdbuf();
-    write("smaps", capture.str());
+    const std::string capture = RKFileText(MEMSPREAD_TEST_DATA "/smaps-fixture.txt");
+    write("smaps", capture);
     write("statm", "2048 700 400 10 0 300 0\n");
     RKLinuxPlatform platform(root.string());
     std::unique_ptr<RKTask> task;
@@ -167,7 +166,7 @@ TEST(RKLinuxWalkFakeTree, SmapsIsReadOnceAWalkAndAProcessGoneMidReadEndsItsWalkA
 
     // statm of a process whose address space was released reads zeros: what was read is kept,
     // and the end of the walk says the process is gone.
-    write("smaps", capture.str());
+    write("smaps", capture);
     write("statm", "0 0 0 0 0 0 0\n");
     Walk gone = walk(platform, *task);
     EXPECT_EQ(gone.end, MACH_SEND_INVALID_DEST);

@@ -3,11 +3,9 @@
 // the kinds it cannot make (huge pages, devices, kernel objects) and what other kernels print.
 #include <gtest/gtest.h>
 
-#include <fstream>
-#include <sstream>
-
 #include "platform/RKLinuxTags.h"
 #include "platform/RKLinuxVmaClassifier.h"
+#include "support/RKRunCommand.h"
 
 namespace {
 
@@ -17,10 +15,7 @@ namespace {
 class RKSmapsTest : public ::testing::Test {
 protected:
     void SetUp() override {
-        std::stringstream text;
-        text << std::ifstream(MEMSPREAD_TEST_DATA "/smaps-edge.txt").rdbuf()
-             << std::ifstream(MEMSPREAD_TEST_DATA "/smaps-fixture.txt").rdbuf();
-        text_ = text.str();
+        text_ = RKFileText(MEMSPREAD_TEST_DATA "/smaps-edge.txt") + RKFileText(MEMSPREAD_TEST_DATA "/smaps-fixture.txt");
         parsed_ = RKParseSmaps(text_, vmas_);
         mounts_ = RKParseMountInfo(
             "26 1 254:0 / / rw - ext4 /dev/vda rw\n"

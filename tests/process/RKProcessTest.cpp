@@ -12,6 +12,7 @@
 #include "platform/RKScriptedPlatform.h"
 #include "process/RKAnalysisSettings.h"
 #include "process/RKUserProcess.h"
+#include "support/RKKeptArgv.h"
 
 namespace {
 
@@ -60,11 +61,8 @@ protected:
     // Resolves a command line (without the program name): the keys of its visible (or hidden)
     // targets; `printed` is what resolving wrote.
     Keys targets(std::vector<std::string> arguments, bool hidden = false, RKError* error = nullptr) {
-        arguments.insert(arguments.begin(), "memspread");
-        std::vector<char*> argv;
-        for (auto& argument : arguments) argv.push_back(argument.data());
-        argv.push_back(nullptr);
-        auto args = RKMemspreadArgs::initWithArgc(static_cast<int>(arguments.size()), argv.data());
+        std::vector<char*> argv = RKKeptArgv(std::move(arguments));
+        auto args = RKMemspreadArgs::initWithArgc(static_cast<int>(argv.size() - 1), argv.data());
         testing::internal::CaptureStderr();
         auto map = args.value().targetProcessesAndError(error);
         printed = testing::internal::GetCapturedStderr();

@@ -10,7 +10,6 @@
 
 #include <sys/types.h>
 
-#include <fstream>
 #include <memory>
 #include <string>
 #include <vector>
@@ -20,6 +19,7 @@
 #include "model/RKMemoryTotal.h"
 #include "model/RKProcessGroup.h"
 #include "output/RKOutputFormatter.h"
+#include "support/RKRunCommand.h"
 
 struct RKRecordedCall {
     std::string formatter;  // the recorder's label
@@ -143,10 +143,8 @@ private:
 
 // The expected journal in tests/data/golden/`name`, without its "#" comment lines.
 inline std::string RKExpectedJournal(const std::string& name) {
-    std::ifstream file(std::string(MEMSPREAD_TEST_DATA) + "/golden/" + name);
-    std::string text, line;
-    while (std::getline(file, line)) {
+    std::string text;
+    for (const std::string& line : RKSplitLines(RKFileText(std::string(MEMSPREAD_TEST_DATA) + "/golden/" + name)))
         if (!line.starts_with("#")) text += line + "\n";
-    }
     return text;
 }

@@ -7,6 +7,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <fstream>
+#include <iterator>
 #include <sstream>
 #include <thread>
 
@@ -65,6 +67,11 @@ RKCommandResult RKRunCommand(const std::vector<std::string>& argv, std::chrono::
     result.standardOutput = out.contents();
     result.standardError = err.contents();
     return result;
+}
+
+std::string RKFileText(const std::string& path) {
+    std::ifstream file(path);
+    return {std::istreambuf_iterator<char>(file), {}};
 }
 
 std::vector<std::string> RKSplitLines(const std::string& text) {

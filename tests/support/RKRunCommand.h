@@ -27,5 +27,8 @@ RKCommandResult RKRunCommand(const std::vector<std::string>& argv,
                              std::chrono::milliseconds timeout = std::chrono::seconds(120),
                              const std::function<void(pid_t)>& whileRunning = nullptr);
 
+// The whole text of the file at `path`; empty when it cannot be read.
+std::string RKFileText(const std::string& path);
+
 // The lines of `text`, each without its "\n"; a final line without "\n" counts too.
 std::vector<std::string> RKSplitLines(const std::string& text);
