@@ -25,6 +25,8 @@ constexpr unsigned long kPagemapScan = _IOWR('f', 16, RKPmScanArg);
 constexpr uint64_t kChunkPages = 4096;     // pagemap entries per pread (32 KiB)
 constexpr uint64_t kFlagsPerRead = 4096;   // kpageflags words per pread at most
 constexpr size_t kScanRunsPerCall = 1024;  // PAGEMAP_SCAN runs per ioctl
+constexpr uint64_t kQueryPages = 4096;     // pages a page query asks for at most
+constexpr uint64_t kSmallHolePages = 64;   // holes up to this long are asked about, longer ones skipped
 
 kern_return_t failureFor(int error) {
     return error == EACCES || error == EPERM ? KERN_PROTECTION_FAILURE : KERN_INVALID_ARGUMENT;
@@ -243,6 +245,12 @@ bool RKLinuxPageData::populated(uint64_t address, uint64_t end, uint64_t pageSiz
     auto it = stretchAtOrAfter(*this, address / pageSize);
     from = it == stretches.end() ? known : std::clamp(it->first * pageSize, address, known);
     to = from == known ? from : std::min(known, (it->first + it->count) * pageSize);
+    // Stretches a few pages apart are asked about together, up to a query's worth: one query
+    // rather than one a stretch where pages alternate.
+    for (++it; it != stretches.end() && to < known && to - from < kQueryPages * pageSize &&
+               it->first * pageSize - to <= kSmallHolePages * pageSize;
+         ++it)
+        to = std::min(known, (it->first + it->count) * pageSize);
     return true;
 }
 

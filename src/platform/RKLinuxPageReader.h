@@ -57,8 +57,9 @@ struct RKLinuxPageData {
     // The dispositions of the pages from `address`, when one range that was read holds them all.
     bool answer(uint64_t address, uint64_t pageSize, std::span<uint32_t> dispositions) const;
     // When a range that was read holds `address`: the first stretch at or after it whose pages
-    // may hold something, clipped to [address, end) and to that range, as [from, to). Pages
-    // from `address` to `from` hold nothing; from == to when no stretch is left in the range.
+    // may hold something (with those that follow it a small hole apart, up to a query's worth),
+    // clipped to [address, end) and to that range, as [from, to). Pages from `address` to
+    // `from` hold nothing; from == to when no stretch is left in the range.
     bool populated(uint64_t address, uint64_t end, uint64_t pageSize, uint64_t& from, uint64_t& to) const;
     // Appends the disposition of `count` pages from `first`, past every page appended so far;
     // 0 (nothing there) keeps nothing.

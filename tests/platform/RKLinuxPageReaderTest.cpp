@@ -36,6 +36,8 @@ TEST(RKLinuxPageData, StretchesAnswerAndTheRestIsAHole) {
         if (!data.populated(address, end, P, from, to)) return std::pair<uint64_t, uint64_t>{1, 1};
         return std::pair{from, to};
     };
+    EXPECT_EQ(populated(0x10000, 0x20000), (std::pair<uint64_t, uint64_t>{0x10000, 0x1B000}))
+        << "a small hole is asked about with its neighbours";
     EXPECT_EQ(populated(0x13000, 0x20000), (std::pair<uint64_t, uint64_t>{0x1A000, 0x1B000}));
     EXPECT_EQ(populated(0x11000, 0x12000), (std::pair<uint64_t, uint64_t>{0x11000, 0x12000})) << "clipped";
     EXPECT_EQ(populated(0x1B000, 0x30000), (std::pair<uint64_t, uint64_t>{0x20000, 0x20000})) << "known to its range's end";
