@@ -6,6 +6,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <functional>
 #include <map>
 #include <mutex>
 
@@ -24,6 +25,8 @@ constexpr unsigned long kPagemapScan = _IOWR('f', 16, RKPmScanArg);
 constexpr uint64_t kChunkPages = 4096;     // pagemap entries per pread (32 KiB)
 constexpr uint64_t kFlagsPerRead = 4096;   // kpageflags words per pread at most
 constexpr size_t kScanRunsPerCall = 1024;  // PAGEMAP_SCAN runs per ioctl
+constexpr uint64_t kQueryPages = 4096;     // pages a page query asks for at most
+constexpr uint64_t kSmallHolePages = 64;   // holes up to this long are asked about, longer ones skipped
 
 kern_return_t failureFor(int error) {
     return error == EACCES || error == EPERM ? KERN_PROTECTION_FAILURE : KERN_INVALID_ARGUMENT;
@@ -56,38 +59,44 @@ RKLinuxPageProbe probe(const std::string& procRoot) {
 // One page whose kpageflags word decides its disposition.
 struct FlagLookup {
     uint64_t frame;
-    uint64_t page;  // index in the whole read
+    uint64_t packed;  // its index in the data's packed bytes
     bool fileMapping;
     uint64_t entry;
 };
 
 class PageReader {
 public:
-    PageReader(int pagemap, uint64_t pageSize, const RKLinuxPageProbe& probe)
-        : pagemap_(pagemap), pageSize_(pageSize), probe_(probe) {}
+    PageReader(int pagemap, uint64_t pageSize, const RKLinuxPageProbe& probe, RKLinuxPageData& data)
+        : pagemap_(pagemap), pageSize_(pageSize), probe_(probe), data_(data) {}
 
-    kern_return_t readRange(const RKPageQueryRange& range, uint64_t firstPage, std::span<uint32_t> out) {
-        // PAGEMAP_SCAN skips holes and tells the zero page; frames are worth reading only where
-        // a page's flags change its disposition (dirty file pages, lazily freed ones).
+    kern_return_t readRange(const RKPageQueryRange& range) {
+        const uint64_t firstPage = range.start / pageSize_;
+        const uint64_t endPage = (range.start + range.size + pageSize_ - 1) / pageSize_;
+        // Frames are worth reading only where a page's flags change its disposition (dirty file
+        // pages, lazily freed ones).
         const bool needFlags = probe_.kpageflags && (range.fileBacked || range.reusablePages > 0);
-        if (probe_.pagemapScan && !needFlags) return scanRange(range, out);
-        std::vector<uint64_t>& entries = entries_;
-        const uint64_t startPage = range.start / pageSize_;
-        for (uint64_t done = 0; done < out.size(); done += kChunkPages) {
-            uint64_t count = std::min<uint64_t>(kChunkPages, out.size() - done);
-            entries.resize(count);
-            if (!RKPreadAll(pagemap_, entries.data(), count * 8, (startPage + done) * 8)) return KERN_INVALID_ARGUMENT;
-            for (uint64_t i = 0; i < count; i++) {
-                out[done + i] = RKDispositionForPagemapEntry(entries[i], range.fileBacked, std::nullopt);
-                if (needFlags && RKPagemapEntryNeedsFlags(entries[i], range.fileBacked))
-                    lookups_.push_back({entries[i] & RKPagemapFrameMask, firstPage + done + i, range.fileBacked, entries[i]});
+        if (!probe_.pagemapScan) return readEntries(firstPage, endPage - firstPage, range.fileBacked, needFlags);
+        kern_return_t result = RKScanPresentPages(pagemap_, firstPage * pageSize_, endPage * pageSize_, runs_);
+        if (result != KERN_SUCCESS) return result;
+        for (size_t i = 0; i < runs_.size();) {
+            const RKPageScanRun& run = runs_[i];
+            if (!needFlags) {
+                data_.append(run.start / pageSize_, (run.end - run.start) / pageSize_,
+                             RKDispositionForScanRun(run.categories, range.fileBacked));
+                i++;
+                continue;
             }
+            // The entries of adjacent runs in one read.
+            uint64_t end = run.end;
+            for (i++; i < runs_.size() && runs_[i].start == end; i++) end = runs_[i].end;
+            result = readEntries(run.start / pageSize_, (end - run.start) / pageSize_, range.fileBacked, true);
+            if (result != KERN_SUCCESS) return result;
         }
         return KERN_SUCCESS;
     }
 
     // Applies kpageflags to every page that needs it, reading the frames in ascending runs.
-    void applyFlags(int kpageflags, std::span<uint32_t> all) {
+    void applyFlags(int kpageflags) {
         std::sort(lookups_.begin(), lookups_.end(), [](const FlagLookup& a, const FlagLookup& b) { return a.frame < b.frame; });
         std::vector<uint64_t> frames;
         frames.reserve(lookups_.size());
@@ -100,44 +109,36 @@ public:
             for (; next < lookups_.size() && lookups_[next].frame < run.first + run.count; next++) {
                 const FlagLookup& lookup = lookups_[next];
                 // A frame past the end of memory leaves the page as pagemap alone says.
-                if (read) all[lookup.page] = RKDispositionForPagemapEntry(lookup.entry, lookup.fileMapping,
-                                                                           words[lookup.frame - run.first]);
+                if (read && lookup.packed < data_.packed.size())
+                    data_.packed[lookup.packed] = RKPackDisposition(
+                        RKDispositionForPagemapEntry(lookup.entry, lookup.fileMapping, words[lookup.frame - run.first]));
             }
         }
         lookups_.clear();
     }
 
 private:
-    kern_return_t scanRange(const RKPageQueryRange& range, std::span<uint32_t> out) {
-        std::vector<RKPageScanRun>& runs = runs_;
-        std::vector<RKPageScanRun>& buffer = scanBuffer_;
-        runs.clear();
-        buffer.resize(kScanRunsPerCall);
-        const uint64_t end = range.start + out.size() * pageSize_;
-        for (uint64_t start = range.start; start < end;) {
-            RKPmScanArg arg{sizeof(RKPmScanArg), 0, start, end, 0, reinterpret_cast<uintptr_t>(buffer.data()),
-                            buffer.size(), 0, 0, 0, RKPageIsPresent | RKPageIsSwapped,
-                            RKPageIsPresent | RKPageIsSwapped | RKPageIsFile | RKPageIsPfnZero};
-            int n = ::ioctl(pagemap_, kPagemapScan, &arg);
-            if (n < 0) {
-                if (errno == EINTR) continue;
-                return failureFor(errno);
+    kern_return_t readEntries(uint64_t firstPage, uint64_t count, bool fileMapping, bool needFlags) {
+        bool read = RKReadPagemap(pagemap_, firstPage, count, [&](uint64_t page, std::span<const uint64_t> entries) {
+            for (uint64_t entry : entries) {
+                const uint32_t disposition = RKDispositionForPagemapEntry(entry, fileMapping, std::nullopt);
+                if (disposition != 0) {
+                    if (needFlags && RKPagemapEntryNeedsFlags(entry, fileMapping))
+                        lookups_.push_back({entry & RKPagemapFrameMask, data_.packed.size(), fileMapping, entry});
+                    data_.append(page, 1, disposition);
+                }
+                page++;
             }
-            runs.insert(runs.end(), buffer.begin(), buffer.begin() + n);
-            if (arg.walk_end <= start) return KERN_INVALID_ARGUMENT;  // no progress: the process went away
-            start = arg.walk_end;
-        }
-        RKDispositionsFromScanRuns(range.start, pageSize_, runs, range.fileBacked, out);
-        return KERN_SUCCESS;
+        });
+        return read ? KERN_SUCCESS : KERN_INVALID_ARGUMENT;
     }
 
     int pagemap_;
     uint64_t pageSize_;
     const RKLinuxPageProbe& probe_;
-    std::vector<uint64_t> entries_;
+    RKLinuxPageData& data_;
     std::vector<FlagLookup> lookups_;
     std::vector<RKPageScanRun> runs_;
-    std::vector<RKPageScanRun> scanBuffer_;
 };
 
 }  // namespace
@@ -164,17 +165,92 @@ const RKLinuxPageProbe& RKProbePageReading(const std::string& procRoot) {
     return it->second;
 }
 
-bool RKLinuxPageData::answer(uint64_t address, uint64_t pageSize, std::span<uint32_t> dispositions) const {
-    auto it = std::upper_bound(ranges.begin(), ranges.end(), address,
+kern_return_t RKScanPresentPages(int pagemap, uint64_t start, uint64_t end, std::vector<RKPageScanRun>& runs) {
+    runs.clear();
+    std::vector<RKPageScanRun> buffer(kScanRunsPerCall);
+    while (start < end) {
+        // Present or swapped, and not the zero page: the kernel skips holes and zero pages.
+        RKPmScanArg arg{sizeof(RKPmScanArg), 0, start, end, 0, reinterpret_cast<uintptr_t>(buffer.data()),
+                        buffer.size(), 0, RKPageIsPfnZero, RKPageIsPfnZero, RKPageIsPresent | RKPageIsSwapped,
+                        RKPageIsPresent | RKPageIsSwapped | RKPageIsFile | RKPageIsPfnZero};
+        int n = ::ioctl(pagemap, kPagemapScan, &arg);
+        if (n < 0) {
+            if (errno == EINTR) continue;
+            return failureFor(errno);
+        }
+        runs.insert(runs.end(), buffer.begin(), buffer.begin() + n);
+        if (arg.walk_end <= start) return KERN_INVALID_ARGUMENT;  // no progress: the process went away
+        start = arg.walk_end;
+    }
+    return KERN_SUCCESS;
+}
+
+bool RKReadPagemap(int pagemap, uint64_t firstPage, uint64_t count,
+                   const std::function<void(uint64_t firstPage, std::span<const uint64_t> entries)>& chunk) {
+    std::vector<uint64_t> entries(std::min(count, kChunkPages));
+    for (uint64_t done = 0; done < count; done += kChunkPages) {
+        const uint64_t n = std::min(kChunkPages, count - done);
+        if (!RKPreadAll(pagemap, entries.data(), n * 8, (firstPage + done) * 8)) return false;
+        chunk(firstPage + done, std::span<const uint64_t>(entries.data(), n));
+    }
+    return true;
+}
+
+void RKLinuxPageData::append(uint64_t first, uint64_t count, uint32_t disposition) {
+    if (count == 0 || disposition == 0) return;
+    if (stretches.empty() || stretches.back().first + stretches.back().count != first)
+        stretches.push_back({first, 0, packed.size()});
+    stretches.back().count += count;
+    packed.insert(packed.end(), count, RKPackDisposition(disposition));
+}
+
+namespace {
+
+// The range that was read whole and holds the page at `address`, or nothing.
+const RKPageQueryRange* readRangeAt(const RKLinuxPageData& data, uint64_t address) {
+    auto it = std::upper_bound(data.ranges.begin(), data.ranges.end(), address,
                                [](uint64_t a, const RKPageQueryRange& r) { return a < r.start + r.size; });
-    if (it == ranges.end() || it->start > address) return false;
-    const size_t index = static_cast<size_t>(it - ranges.begin());
-    const uint64_t first = (address - it->start) / pageSize;
-    const uint64_t pages = (it->size + pageSize - 1) / pageSize;
-    if (first + dispositions.size() > pages || index >= firstPage.size()) return false;
-    const uint64_t base = firstPage[index] + first;
-    if (base + dispositions.size() > packed.size()) return false;  // the read stopped before it
-    for (size_t i = 0; i < dispositions.size(); i++) dispositions[i] = RKUnpackDisposition(packed[base + i]);
+    if (it == data.ranges.end() || it->start > address) return nullptr;
+    if (static_cast<size_t>(it - data.ranges.begin()) >= data.rangesRead) return nullptr;  // the read stopped before it
+    return &*it;
+}
+
+// The first stretch that ends after `page`.
+std::vector<RKPageStretch>::const_iterator stretchAtOrAfter(const RKLinuxPageData& data, uint64_t page) {
+    return std::upper_bound(data.stretches.begin(), data.stretches.end(), page,
+                            [](uint64_t p, const RKPageStretch& s) { return p < s.first + s.count; });
+}
+
+}  // namespace
+
+bool RKLinuxPageData::answer(uint64_t address, uint64_t pageSize, std::span<uint32_t> dispositions) const {
+    const RKPageQueryRange* range = readRangeAt(*this, address);
+    if (!range) return false;
+    const uint64_t first = address / pageSize, end = first + dispositions.size();
+    if (end > (range->start + range->size + pageSize - 1) / pageSize) return false;
+    std::fill(dispositions.begin(), dispositions.end(), 0u);
+    for (auto it = stretchAtOrAfter(*this, first); it != stretches.end() && it->first < end; ++it) {
+        const uint64_t from = std::max(first, it->first), to = std::min(end, it->first + it->count);
+        for (uint64_t page = from; page < to; page++)
+            dispositions[page - first] = RKUnpackDisposition(packed[it->offset + (page - it->first)]);
+    }
+    return true;
+}
+
+bool RKLinuxPageData::populated(uint64_t address, uint64_t end, uint64_t pageSize, uint64_t& from, uint64_t& to) const {
+    const RKPageQueryRange* range = readRangeAt(*this, address);
+    if (!range) return false;
+    // Past the range nothing is known: it may be another range's, read or not.
+    const uint64_t known = std::min(end, (range->start + range->size + pageSize - 1) / pageSize * pageSize);
+    auto it = stretchAtOrAfter(*this, address / pageSize);
+    from = it == stretches.end() ? known : std::clamp(it->first * pageSize, address, known);
+    to = from == known ? from : std::min(known, (it->first + it->count) * pageSize);
+    // Stretches a few pages apart are asked about together, up to a query's worth: one query
+    // rather than one a stretch where pages alternate.
+    for (++it; it != stretches.end() && to < known && to - from < kQueryPages * pageSize &&
+               it->first * pageSize - to <= kSmallHolePages * pageSize;
+         ++it)
+        to = std::min(known, (it->first + it->count) * pageSize);
     return true;
 }
 
@@ -182,34 +258,27 @@ kern_return_t RKReadPageData(int directoryFd, const std::string& procRoot, uint6
                              const std::vector<RKPageQueryRange>& ranges, RKLinuxPageData& data) {
     data = RKLinuxPageData{};
     data.ranges = ranges;
-    uint64_t total = 0;
-    for (const RKPageQueryRange& range : ranges) {
-        data.firstPage.push_back(total);
-        total += (range.start % pageSize + range.size + pageSize - 1) / pageSize;
-    }
     const RKLinuxPageProbe& probe = RKProbePageReading(procRoot);
     RKUniqueFd pagemap(::openat(directoryFd, "pagemap", O_RDONLY | O_CLOEXEC));
     if (!pagemap.valid()) return data.result = failureFor(errno);
-    std::vector<uint32_t> all(total);
-    PageReader reader(pagemap.get(), pageSize, probe);
-    uint64_t readPages = 0;
-    for (size_t i = 0; i < ranges.size() && data.result == KERN_SUCCESS; i++) {
-        RKPageQueryRange aligned = ranges[i];
-        aligned.start -= aligned.start % pageSize;
-        const uint64_t pages = (i + 1 < ranges.size() ? data.firstPage[i + 1] : total) - data.firstPage[i];
-        data.result = reader.readRange(aligned, data.firstPage[i], std::span(all).subspan(data.firstPage[i], pages));
-        if (data.result == KERN_SUCCESS) readPages = data.firstPage[i] + pages;
+    PageReader reader(pagemap.get(), pageSize, probe, data);
+    // Where each range's packed bytes begin, and where the last one read ends.
+    std::vector<uint64_t> packedStart;
+    for (const RKPageQueryRange& range : ranges) {
+        packedStart.push_back(data.packed.size());
+        data.result = reader.readRange(range);
+        if (data.result != KERN_SUCCESS) break;
+        data.rangesRead++;
     }
     if (probe.kpageflags) {
         RKUniqueFd kpageflags(::open((procRoot + "/kpageflags").c_str(), O_RDONLY | O_CLOEXEC));
-        if (kpageflags.valid()) reader.applyFlags(kpageflags.get(), all);
+        if (kpageflags.valid()) reader.applyFlags(kpageflags.get());
     }
-    for (size_t i = 0; i < ranges.size(); i++) {
-        const uint64_t end = i + 1 < ranges.size() ? data.firstPage[i + 1] : total;
-        if (end > readPages) break;
-        RKLimitReusablePages(std::span(all).subspan(data.firstPage[i], end - data.firstPage[i]), ranges[i].reusablePages);
+    for (size_t i = 0; i < data.rangesRead; i++) {
+        const uint64_t end = i + 1 < packedStart.size() ? packedStart[i + 1] : data.packed.size();
+        RKLimitReusablePages(std::span(data.packed).subspan(packedStart[i], end - packedStart[i]), ranges[i].reusablePages);
     }
-    data.packed.resize(readPages);
-    for (uint64_t i = 0; i < readPages; i++) data.packed[i] = RKPackDisposition(all[i]);
+    data.packed.shrink_to_fit();
+    data.stretches.shrink_to_fit();
     return data.result;
 }

@@ -1,5 +1,6 @@
 // Page queries on Linux: answered from the page data read ahead for the ranges a process is
-// about to ask for, or read on the spot for a range nobody announced.
+// about to ask for (which also tells where nothing is, so the holes are never asked about), or
+// read on the spot for a range nobody announced.
 #include <algorithm>
 
 #include "platform/RKLinuxPlatform.h"
@@ -54,6 +55,15 @@ kern_return_t RKLinuxPlatform::pageRangeQuery(RKTask& task, uint64_t address, ui
     if (!data.answer(address, page, out)) return KERN_FAILURE;
     count = pages;
     return KERN_SUCCESS;
+}
+
+RKPageSpan RKLinuxPlatform::pageQueryPopulated(RKTask& task, uint64_t address, uint64_t end) {
+    auto* target = dynamic_cast<RKLinuxTask*>(&task);
+    RKPageSpan span{address, end};
+    // Outside what was read ahead, ask: the query reads it, or tells why it cannot.
+    if (!target || !target->pageData || !target->pageData->populated(address, end, kernelPageSize(), span.from, span.to))
+        return {address, end};
+    return span;
 }
 
 RKPageQueryAbilities RKLinuxPlatform::pageQueryAbilities() {

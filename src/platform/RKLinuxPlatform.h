@@ -38,6 +38,7 @@ public:
                                  uint32_t* dispositions, uint64_t& count) override;
     // Page queries (RKLinuxPages.cpp).
     void preparePageRangeQueries(RKTask& task, const std::vector<RKPageQueryRange>& ranges) override;
+    RKPageSpan pageQueryPopulated(RKTask& task, uint64_t address, uint64_t end) override;
     RKPageQueryAbilities pageQueryAbilities() override;
     // Shared anonymous pages (RKLinuxSharedFrames.cpp).
     kern_return_t sharedAnonymousPages(RKTask& task, const std::vector<RKPageQueryRange>& ranges,

@@ -1,5 +1,6 @@
 // The anonymous pages a process shares with other mappings (after fork, or merged by KSM),
-// identified by frame number, or by swap entry when swapped: pagemap read in chunks, then
+// identified by frame number, or by swap entry when swapped: pagemap read in chunks (where
+// PAGEMAP_SCAN found pages, when the kernel has it), then
 // /proc/kpagecount and /proc/kpageflags over runs of consecutive frames. Exclusivity comes
 // from kpagecount, not pagemap's bit 56, which is wrong for PMD-mapped huge pages.
 #include <fcntl.h>
@@ -16,26 +17,38 @@
 
 namespace {
 
-constexpr uint64_t kChunkPages = 4096;
 constexpr uint64_t kFramesPerRead = 4096;
 
-// Every present page (by frame) and swapped page (by swap entry) of the ranges.
-kern_return_t readCandidates(int pagemap, uint64_t pageSize, const std::vector<RKPageQueryRange>& ranges,
+// Every present page (by frame) and swapped page (by swap entry) of the ranges. Where the
+// kernel has PAGEMAP_SCAN, pagemap is read only where it found pages.
+kern_return_t readCandidates(int pagemap, uint64_t pageSize, bool scan, const std::vector<RKPageQueryRange>& ranges,
                              std::vector<RKSharedAnonymousPage>& pages) {
-    std::vector<uint64_t> entries;
+    std::vector<RKPageScanRun> runs;
     for (uint32_t r = 0; r < ranges.size(); r++) {
-        const uint64_t first = ranges[r].start / pageSize;
-        const uint64_t count = (ranges[r].start % pageSize + ranges[r].size + pageSize - 1) / pageSize;
-        for (uint64_t done = 0; done < count; done += kChunkPages) {
-            entries.resize(std::min(kChunkPages, count - done));
-            if (!RKPreadAll(pagemap, entries.data(), entries.size() * 8, (first + done) * 8)) return KERN_INVALID_ARGUMENT;
+        const bool fileBacked = ranges[r].fileBacked;
+        auto take = [&](uint64_t, std::span<const uint64_t> entries) {
             for (uint64_t entry : entries) {
-                if (ranges[r].fileBacked && (entry & RKPagemapFilePage)) continue;  // page cache, not a copy
+                if (fileBacked && (entry & RKPagemapFilePage)) continue;  // page cache, not a copy
                 if ((entry & RKPagemapPresent) && (entry & RKPagemapFrameMask) != 0)
                     pages.push_back({entry & RKPagemapFrameMask, r, 0});
                 else if (!(entry & RKPagemapPresent) && (entry & RKPagemapSwapped))
                     pages.push_back({RKSwappedPageKey | (entry & RKPagemapFrameMask), r, 1});
             }
+        };
+        const uint64_t first = ranges[r].start / pageSize;
+        const uint64_t end = (ranges[r].start + ranges[r].size + pageSize - 1) / pageSize;
+        if (!scan) {
+            if (!RKReadPagemap(pagemap, first, end - first, take)) return KERN_INVALID_ARGUMENT;
+            continue;
+        }
+        kern_return_t result = RKScanPresentPages(pagemap, first * pageSize, end * pageSize, runs);
+        if (result != KERN_SUCCESS) return result;
+        for (size_t i = 0; i < runs.size();) {
+            // Adjacent runs (pages of other categories) in one read.
+            const uint64_t start = runs[i].start;
+            uint64_t stop = runs[i].end;
+            for (i++; i < runs.size() && runs[i].start == stop; i++) stop = runs[i].end;
+            if (!RKReadPagemap(pagemap, start / pageSize, (stop - start) / pageSize, take)) return KERN_INVALID_ARGUMENT;
         }
     }
     return KERN_SUCCESS;
@@ -89,7 +102,8 @@ kern_return_t RKLinuxPlatform::sharedAnonymousPages(RKTask& task, const std::vec
     }
     RKUniqueFd pagemap(::openat(target->directoryFd(), "pagemap", O_RDONLY | O_CLOEXEC));
     if (!pagemap.valid()) return errno == EACCES || errno == EPERM ? KERN_PROTECTION_FAILURE : KERN_INVALID_ARGUMENT;
-    kern_return_t result = readCandidates(pagemap.get(), kernelPageSize(), ranges, pages);
+    kern_return_t result =
+        readCandidates(pagemap.get(), kernelPageSize(), RKProbePageReading(procRoot()).pagemapScan, ranges, pages);
     if (result != KERN_SUCCESS) return result;
     std::sort(pages.begin(), pages.end(), [](const auto& a, const auto& b) { return a.page < b.page; });
     RKUniqueFd kpagecount(::open((procRoot() + "/kpagecount").c_str(), O_RDONLY | O_CLOEXEC));

@@ -37,30 +37,20 @@ bool RKPagemapEntryNeedsFlags(uint64_t entry, bool fileMapping) {
     return !(entry & RKPagemapFilePage) || fileMapping;
 }
 
-void RKDispositionsFromScanRuns(uint64_t start, uint64_t pageSize, std::span<const RKPageScanRun> runs,
-                                bool fileMapping, std::span<uint32_t> dispositions) {
-    std::fill(dispositions.begin(), dispositions.end(), 0u);
-    const uint64_t end = start + dispositions.size() * pageSize;
-    for (const RKPageScanRun& run : runs) {
-        uint64_t from = std::max(run.start, start), to = std::min(run.end, end);
-        if (from >= to) continue;
-        uint32_t disposition = 0;
-        if ((run.categories & RKPageIsPresent) && !(run.categories & RKPageIsPfnZero))
-            disposition = presentPage(run.categories & RKPageIsFile, fileMapping, false, false);
-        else if (run.categories & RKPageIsSwapped)
-            disposition = VM_PAGE_QUERY_PAGE_PAGED_OUT;
-        std::fill(dispositions.begin() + static_cast<ptrdiff_t>((from - start) / pageSize),
-                  dispositions.begin() + static_cast<ptrdiff_t>((to - start + pageSize - 1) / pageSize), disposition);
-    }
+uint32_t RKDispositionForScanRun(uint64_t categories, bool fileMapping) {
+    if ((categories & RKPageIsPresent) && !(categories & RKPageIsPfnZero))
+        return presentPage(categories & RKPageIsFile, fileMapping, false, false);
+    if (categories & RKPageIsSwapped) return VM_PAGE_QUERY_PAGE_PAGED_OUT;
+    return 0;
 }
 
-void RKLimitReusablePages(std::span<uint32_t> dispositions, uint64_t reusablePages) {
-    for (uint32_t& disposition : dispositions) {
-        if (!(disposition & VM_PAGE_QUERY_PAGE_REUSABLE)) continue;
+void RKLimitReusablePages(std::span<uint8_t> packed, uint64_t reusablePages) {
+    for (uint8_t& page : packed) {
+        if (!(RKUnpackDisposition(page) & VM_PAGE_QUERY_PAGE_REUSABLE)) continue;
         if (reusablePages > 0) {
             reusablePages--;
         } else {
-            disposition = VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY;
+            page = RKPackDisposition(VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY);
         }
     }
 }

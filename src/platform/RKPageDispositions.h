@@ -47,15 +47,14 @@ uint32_t RKDispositionForPagemapEntry(uint64_t entry, bool fileMapping, std::opt
 // freed). Shmem pages are memory whatever their flags say.
 bool RKPagemapEntryNeedsFlags(uint64_t entry, bool fileMapping);
 
-// The dispositions of the `pages` pages from `start` that the PAGEMAP_SCAN runs describe;
-// pages in no run (holes, pages never touched) get 0.
-void RKDispositionsFromScanRuns(uint64_t start, uint64_t pageSize, std::span<const RKPageScanRun> runs,
-                                bool fileMapping, std::span<uint32_t> dispositions);
+// The disposition of every page of a PAGEMAP_SCAN run with these categories; pages in no run
+// (holes, pages never touched) are 0.
+uint32_t RKDispositionForScanRun(uint64_t categories, bool fileMapping);
 
 // A lazily freed page that was written again keeps its flags and only the mapping's LazyFree
-// count knows: keeps the reusable mark on the first `reusablePages` pages that have it and
-// turns the rest back into dirty memory.
-void RKLimitReusablePages(std::span<uint32_t> dispositions, uint64_t reusablePages);
+// count knows: keeps the reusable mark on the first `reusablePages` pages (packed dispositions,
+// in address order) that have it and turns the rest back into dirty memory.
+void RKLimitReusablePages(std::span<uint8_t> packed, uint64_t reusablePages);
 
 // Frame numbers sorted and cut into runs of consecutive frames, each at most `maxRun` long,
 // so that /proc/kpageflags is read with one pread per run. `frames` must be sorted.

@@ -30,6 +30,12 @@ public:
     virtual pid_t pid() const = 0;
 };
 
+// Addresses [from, to).
+struct RKPageSpan {
+    uint64_t from = 0;
+    uint64_t to = 0;
+};
+
 class RKPlatform {
 public:
     virtual ~RKPlatform() = default;
@@ -84,6 +90,15 @@ public:
     // `count` is in: room in `dispositions`, out: the number written.
     virtual kern_return_t pageRangeQuery(RKTask& task, uint64_t address, uint64_t size,
                                          uint32_t* dispositions, uint64_t& count) = 0;
+    // Where page queries of [address, end) (page-aligned) are worth asking: the first stretch at
+    // or after `address` whose pages may hold something, as [from, to) with address <= from <=
+    // to <= end, and from < to unless from > address. Pages from `address` to `from` answer 0;
+    // ask again from `to`. The Mach-style queries answer per page, so the default knows of no
+    // hole: [address, end). On Linux the page data read ahead knows where nothing is mapped.
+    virtual RKPageSpan pageQueryPopulated(RKTask& task, uint64_t address, uint64_t end) {
+        (void)task;
+        return {address, end};
+    }
     // Reads the page data of `ranges` (ascending, disjoint) in one pass, so that the
     // pageRangeQuery calls that follow inside them are answered without reading again. An empty
     // list releases what was read. A failure here shows in those queries.

@@ -178,6 +178,20 @@ kern_return_t RKScriptedPlatform::pageRangeQuery(RKTask& task, uint64_t address,
     return KERN_SUCCESS;
 }
 
+RKPageSpan RKScriptedPlatform::pageQueryPopulated(RKTask& task, uint64_t address, uint64_t end) {
+    record("pageQueryPopulated", task.pid());
+    auto* process = find(task.pid());
+    // A query that fails is asked, so that it fails.
+    if (!process || process->pageQueryResult != KERN_SUCCESS) return {address, end};
+    // The scripted pages hold something; every other page answers 0.
+    auto it = process->dispositions.lower_bound(address);
+    if (it == process->dispositions.end() || it->first >= end) return {end, end};
+    RKPageSpan span{it->first, it->first};
+    for (; it != process->dispositions.end() && it->first == span.to && span.to < end; ++it) span.to += pageSize;
+    span.to = std::min(span.to, end);
+    return span;
+}
+
 void RKScriptedPlatform::preparePageRangeQueries(RKTask& task, const std::vector<RKPageQueryRange>& ranges) {
     record("preparePageRangeQueries", task.pid());
     std::lock_guard lock(mutex_);

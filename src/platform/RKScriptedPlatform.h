@@ -127,6 +127,7 @@ public:
     kern_return_t pageRangeQuery(RKTask& task, uint64_t address, uint64_t size,
                                  uint32_t* dispositions, uint64_t& count) override;
     void preparePageRangeQueries(RKTask& task, const std::vector<RKPageQueryRange>& ranges) override;
+    RKPageSpan pageQueryPopulated(RKTask& task, uint64_t address, uint64_t end) override;
     RKPageQueryAbilities pageQueryAbilities() override;
     kern_return_t sharedAnonymousPages(RKTask& task, const std::vector<RKPageQueryRange>& ranges,
                                        std::vector<RKSharedAnonymousPage>& pages, uint64_t& sharedBytes) override;

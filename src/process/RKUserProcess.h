@@ -37,10 +37,9 @@ struct RKSubrangeCandidate {
     RKPageQueryRange range;
 };
 
-// Receives one chunk of page dispositions: the dispositions, how many, the chunk's index and
-// the number of chunks.
-using RKDispositionChunkBlock =
-    std::function<void(const uint32_t* dispositions, uint64_t count, uint64_t chunk, uint64_t chunks)>;
+// Receives the dispositions of `count` pages, the first of them the `first`th page asked for.
+// No dispositions: a hole, pages that all answer 0, handed over whole however long.
+using RKDispositionChunkBlock = std::function<void(const uint32_t* dispositions, uint64_t first, uint64_t count)>;
 
 // What one region-building pass carries from region to region and into the steps after it.
 struct RKRegionWalkState {
@@ -127,8 +126,9 @@ public:
 
     // ---- Page dispositions (RKUserProcessPages.cpp) ----
     // Asks for the dispositions of `pagesToQuery` pages from the page-aligned `startAddr`, at
-    // most 4096 pages a call, handing each chunk to `block`. False, after an error or (for a
-    // process that exited) a warning, when a query failed.
+    // most 4096 pages a call, handing each chunk to `block` in order; the holes the platform
+    // knows of are handed over as one piece each, never asked about. False, after an error or
+    // (for a process that exited) a warning, when a query failed.
     virtual bool _enumerateDispositionChunks(uint64_t startAddr, uint64_t pagesToQuery,
                                              const RKDispositionChunkBlock& block);
     // Sizes a region (dirty and swapped, which must be 0) from page dispositions instead of the

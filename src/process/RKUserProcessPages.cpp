@@ -1,6 +1,7 @@
-// Page dispositions of a live user process: the chunked queries, the sizing of a region from
-// dispositions (with the page two adjacent regions share), and the runs of like pages that let
-// the analysis tell which pages of an object each process holds.
+// Page dispositions of a live user process: the chunked queries (which skip the holes the
+// platform knows of, so that a sparse terabyte costs its pages, not its size), the sizing of a
+// region from dispositions (with the page two adjacent regions share), and the runs of like
+// pages that let the analysis tell which pages of an object each process holds.
 #include <algorithm>
 #include <vector>
 
@@ -47,6 +48,12 @@ public:
         kind_ = kind;
         (kind == RKPageKind::none ? offset_ : length_) += pageSize_;
     }
+    // `pages` pages that hold nothing, as many add(none) would, at once.
+    void skip(uint64_t pages) {
+        if (kind_ != RKPageKind::none && length_ != 0) flush();
+        kind_ = RKPageKind::none;
+        offset_ += pages * pageSize_;
+    }
 
 private:
     void flush() {
@@ -75,26 +82,35 @@ private:
 
 bool RKUserProcess::_enumerateDispositionChunks(uint64_t startAddr, uint64_t pagesToQuery,
                                                 const RKDispositionChunkBlock& block) {
-    const uint64_t chunkPages = std::min(pagesToQuery, kChunkPages);
-    const uint64_t chunks = (pagesToQuery + kChunkPages - 1) / kChunkPages;
-    if (chunks == 0) return true;
+    if (pagesToQuery == 0) return true;
     const uint64_t page = pageSize();
-    std::vector<uint32_t> buffer(chunkPages);
+    const uint64_t end = startAddr + pagesToQuery * page;
+    std::vector<uint32_t> buffer(std::min(pagesToQuery, kChunkPages));
     uint64_t address = startAddr;
-    uint64_t remaining = pagesToQuery;
-    for (uint64_t chunk = 0; chunk < chunks; chunk++) {
-        uint64_t count = std::min(remaining, chunkPages);
-        kern_return_t result = task_ ? RKPlatform::current().pageRangeQuery(*task_, address, count * page, buffer.data(), count)
-                                     : KERN_INVALID_ARGUMENT;
-        if (result != KERN_SUCCESS) {
-            mach_error("mach_vm_page_range_query", result);
-            _processMachVMError(result, KERN_INVALID_ARGUMENT);
-            pageQueryFailed_ = true;
-            return false;
+    while (address < end) {
+        RKPageSpan span = task_ ? RKPlatform::current().pageQueryPopulated(*task_, address, end) : RKPageSpan{address, end};
+        // Whole pages within what is asked, and always moving on, whatever the platform says.
+        span.from = std::clamp(span.from & ~(page - 1), address, end);
+        span.to = std::clamp((span.to + page - 1) & ~(page - 1), span.from, end);
+        if (span.to == address) span.to = end;
+        if (span.from > address) {
+            block(nullptr, (address - startAddr) / page, (span.from - address) / page);
+            address = span.from;
         }
-        block(buffer.data(), count, chunk, chunks);
-        address += kChunkPages * page;
-        remaining -= std::min(remaining, kChunkPages);
+        while (address < span.to) {
+            const uint64_t asked = std::min(kChunkPages, (span.to - address) / page);
+            uint64_t count = asked;
+            kern_return_t result = task_ ? RKPlatform::current().pageRangeQuery(*task_, address, count * page, buffer.data(), count)
+                                         : KERN_INVALID_ARGUMENT;
+            if (result != KERN_SUCCESS) {
+                mach_error("mach_vm_page_range_query", result);
+                _processMachVMError(result, KERN_INVALID_ARGUMENT);
+                pageQueryFailed_ = true;
+                return false;
+            }
+            block(buffer.data(), (address - startAddr) / page, count);
+            address += asked * page;
+        }
     }
     return true;
 }
@@ -131,32 +147,41 @@ bool RKUserProcess::_populateMemoryRegionWithPageQueries(RKMemoryRegion& region,
         return true;
     }
 
-    bool queried = _enumerateDispositionChunks(queryStart, pages, [&](const uint32_t* dispositions, uint64_t count,
-                                                                       uint64_t chunk, uint64_t chunks) {
-        for (uint64_t j = 0; j < count; j++) {
-            const bool partialFirst = j == 0 && chunk == 0 && !firstCached && startUnaligned;
-            const bool partialLast = chunk == chunks - 1 && j == count - 1 && endUnaligned && !partialFirst;
-            uint64_t bytes = page;
-            if (partialFirst) {
-                bytes = firstPageBytes;
-            } else if (partialLast) {
-                bytes = end - (endBoundary - page);
-                RKAssert(bytes <= region.size, "RKUserProcess", "partial last page within the region");
-            }
-            charge(dispositions[j], bytes, dirty, swapped);
-            if (partialFirst && pendingUnusedSharedRegion_) {
-                RKMemoryRegion& pending = *pendingUnusedSharedRegion_;
-                RKAssert(pending.end() == start, "RKUserProcess", "pending unused shared region ends here");
-                const uint64_t shared = pending.end() - (pending.end() & ~(page - 1));
-                RKAssert(shared <= pending.size, "RKUserProcess", "shared bytes within the pending region");
-                charge(dispositions[j], shared, pending.dirtySize, pending.swappedSize);
-                pendingUnusedSharedRegion_ = nullptr;
-            }
-            if (partialLast) {
-                cachedDispositionAddress_ = endBoundary - page;
-                cachedDisposition_ = dispositions[j];
-            }
+    // The page at `index` of those queried: the first and last may be partial, the first may
+    // be shared with a pending unused region, the last with the next region.
+    auto onePage = [&](uint64_t index, uint32_t disposition) {
+        const bool partialFirst = index == 0 && !firstCached && startUnaligned;
+        const bool partialLast = index == pages - 1 && endUnaligned && !partialFirst;
+        uint64_t bytes = page;
+        if (partialFirst) {
+            bytes = firstPageBytes;
+        } else if (partialLast) {
+            bytes = end - (endBoundary - page);
+            RKAssert(bytes <= region.size, "RKUserProcess", "partial last page within the region");
         }
+        charge(disposition, bytes, dirty, swapped);
+        if (partialFirst && pendingUnusedSharedRegion_) {
+            RKMemoryRegion& pending = *pendingUnusedSharedRegion_;
+            RKAssert(pending.end() == start, "RKUserProcess", "pending unused shared region ends here");
+            const uint64_t shared = pending.end() - (pending.end() & ~(page - 1));
+            RKAssert(shared <= pending.size, "RKUserProcess", "shared bytes within the pending region");
+            charge(disposition, shared, pending.dirtySize, pending.swappedSize);
+            pendingUnusedSharedRegion_ = nullptr;
+        }
+        if (partialLast) {
+            cachedDispositionAddress_ = endBoundary - page;
+            cachedDisposition_ = disposition;
+        }
+    };
+    bool queried = _enumerateDispositionChunks(queryStart, pages, [&](const uint32_t* dispositions, uint64_t first,
+                                                                       uint64_t count) {
+        if (dispositions) {
+            for (uint64_t j = 0; j < count; j++) onePage(first + j, dispositions[j]);
+            return;
+        }
+        // A hole charges nothing; only its ends can be pages with more to do than counting.
+        onePage(first, 0);
+        if (count > 1) onePage(first + count - 1, 0);
     });
     region.swappedSize = swapped;
     region.dirtySize = dirty;
@@ -172,12 +197,16 @@ void RKUserProcess::_addSubrangesForRegion(RKMemoryRegion& region, int purgeStat
         purgeState == VM_PURGABLE_VOLATILE ? VM_PAGE_QUERY_PAGE_PRESENT : VM_PAGE_QUERY_PAGE_REUSABLE;
     RKPageRun run(region, page);
     bool queried = _enumerateDispositionChunks(firstPage, (endBoundary - firstPage) / page,
-                                               [&](const uint32_t* dispositions, uint64_t count, uint64_t chunk, uint64_t chunks) {
+                                               [&](const uint32_t* dispositions, uint64_t, uint64_t count) {
+        if (!dispositions) return run.skip(count);
         for (uint64_t j = 0; j < count; j++) run.add(pageKind(dispositions[j], reclaimableBit));
-        if (chunk == chunks - 1) run.add(RKPageKind::none);
     });
     // Runs of a region only partly read would undercount it: its counters stand instead.
-    if (!queried) region.freeSubrangeList();
+    if (queried) {
+        run.skip(1);  // ends the last run
+    } else {
+        region.freeSubrangeList();
+    }
 }
 
 void RKUserProcess::_addSubrangesIfEligible(const std::shared_ptr<RKMemoryRegion>& region, const RKRegionSubmapInfo& info,

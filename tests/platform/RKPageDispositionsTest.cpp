@@ -32,24 +32,22 @@ TEST(RKPageDispositions, PagemapEntryWithAndWithoutFlags) {
     EXPECT_FALSE(RKPagemapEntryNeedsFlags(RKPagemapPresent, false)) << "no frame to look up";
 }
 
-TEST(RKPageDispositions, ScanRunsCoverTheRangeAndHolesAreAbsent) {
-    const uint64_t P = 4096, start = 0x10000;
-    const RKPageScanRun runs[] = {
-        {start - P, start + 2 * P, RKPageIsPresent},                  // starts before the range
-        {start + 3 * P, start + 4 * P, RKPageIsPresent | RKPageIsPfnZero},
-        {start + 4 * P, start + 5 * P, RKPageIsSwapped},
-        {start + 5 * P, start + 9 * P, RKPageIsPresent | RKPageIsFile},  // ends after it
-    };
-    std::vector<uint32_t> out(7, 0xFFFF);
-    RKDispositionsFromScanRuns(start, P, runs, true, out);
-    EXPECT_EQ(out, (std::vector<uint32_t>{kPresent | kDirty, kPresent | kDirty, 0, 0, VM_PAGE_QUERY_PAGE_PAGED_OUT,
-                                          kPresent | kFile, kPresent | kFile}));
+TEST(RKPageDispositions, ScanRunCategories) {
+    EXPECT_EQ(RKDispositionForScanRun(RKPageIsPresent, true), kPresent | kDirty);
+    EXPECT_EQ(RKDispositionForScanRun(RKPageIsPresent | RKPageIsPfnZero, false), 0u) << "the zero page is absent";
+    EXPECT_EQ(RKDispositionForScanRun(RKPageIsSwapped, false), uint32_t{VM_PAGE_QUERY_PAGE_PAGED_OUT});
+    EXPECT_EQ(RKDispositionForScanRun(RKPageIsPresent | RKPageIsFile, true), kPresent | kFile);
+    EXPECT_EQ(RKDispositionForScanRun(RKPageIsPresent | RKPageIsFile, false), kPresent | kDirty) << "shmem is memory";
 }
 
 TEST(RKPageDispositions, LazyFreeCapAndPacking) {
-    std::vector<uint32_t> pages = {kPresent | kReusable, kPresent | kDirty, kPresent | kReusable, kPresent | kReusable};
+    std::vector<uint8_t> pages;
+    for (uint32_t d : {kPresent | kReusable, kPresent | kDirty, kPresent | kReusable, kPresent | kReusable})
+        pages.push_back(RKPackDisposition(d));
     RKLimitReusablePages(pages, 2);
-    EXPECT_EQ(pages, (std::vector<uint32_t>{kPresent | kReusable, kPresent | kDirty, kPresent | kReusable, kPresent | kDirty}))
+    std::vector<uint32_t> unpacked;
+    for (uint8_t p : pages) unpacked.push_back(RKUnpackDisposition(p));
+    EXPECT_EQ(unpacked, (std::vector<uint32_t>{kPresent | kReusable, kPresent | kDirty, kPresent | kReusable, kPresent | kDirty}))
         << "a rewritten lazily freed page keeps its flags; only smaps' count knows";
     for (uint32_t d : {0u, kPresent | kDirty | kFile, kPresent | kReusable, uint32_t{VM_PAGE_QUERY_PAGE_PAGED_OUT}})
         EXPECT_EQ(RKUnpackDisposition(RKPackDisposition(d)), d);

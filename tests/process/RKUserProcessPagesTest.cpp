@@ -53,18 +53,48 @@ protected:
     std::string printed;
 };
 
-TEST_F(RKUserProcessPagesTest, ChunksOf4096Pages) {
+TEST_F(RKUserProcessPagesTest, ChunksOf4096PagesAndHolesWhole) {
+    for (uint64_t i = 0; i < 4097; i++) tool().dispositions[0x100000 + i * P] = kPresent;
+    tool().dispositions[0x100000 + 10000 * P] = kPresent;
     auto tool = process();
-    for (uint64_t pages : {0ull, 4096ull, 4097ull}) {
-        std::vector<std::array<uint64_t, 3>> chunks;
-        EXPECT_TRUE(tool->_enumerateDispositionChunks(0x100000, pages, [&](const uint32_t*, uint64_t n, uint64_t i, uint64_t of) {
-            chunks.push_back({n, i, of});
+    for (uint64_t pages : {0ull, 4096ull, 10001ull}) {
+        std::vector<std::array<uint64_t, 3>> pieces;  // has dispositions, first, count
+        EXPECT_TRUE(tool->_enumerateDispositionChunks(0x100000, pages, [&](const uint32_t* d, uint64_t first, uint64_t n) {
+            pieces.push_back({d != nullptr, first, n});
         }));
         std::vector<std::array<uint64_t, 3>> expected;
-        if (pages == 4096) expected = {{4096, 0, 1}};
-        if (pages == 4097) expected = {{4096, 0, 2}, {1, 1, 2}};
-        EXPECT_EQ(chunks, expected) << pages;
+        if (pages == 4096) expected = {{1, 0, 4096}};
+        if (pages == 10001) expected = {{1, 0, 4096}, {1, 4096, 1}, {0, 4097, 5903}, {1, 10000, 1}};
+        EXPECT_EQ(pieces, expected) << pages;
     }
+}
+
+// A terabyte reserved and barely touched (a sanitizer's shadow, a runtime's heap) costs its
+// pages: sized and split exactly, with the holes never asked about.
+TEST_F(RKUserProcessPagesTest, SparseTerabyteCostsItsPagesOnly) {
+    const uint64_t base = 0x100000000000, T = 1ull << 40, middle = base + T / 2;
+    script(base, {kPresent});
+    script(middle, {kPresent, kPagedOut, kPresent | kFile});
+    script(base + T - P, {kPresent});
+    auto tool = process();
+    auto region = regionOf(base + 0x800, base + T - 0x800);
+    EXPECT_TRUE(tool->_populateMemoryRegionWithPageQueries(*region, {}));
+    EXPECT_EQ(region->dirtySize, 0x800 + P + 0x800);
+    EXPECT_EQ(region->swappedSize, P);
+    auto next = regionOf(base + T - 0x800, base + T + P);
+    EXPECT_TRUE(tool->_populateMemoryRegionWithPageQueries(*next, {}));
+    EXPECT_EQ(next->dirtySize, 0x800u) << "the last page from the cache, then a hole";
+    EXPECT_EQ(platform->callCount("pageRangeQuery"), 3u) << "one query per stretch of pages, none for the holes";
+
+    auto whole = regionOf(base, base + T);
+    tool->_addSubrangesForRegion(*whole, VM_PURGABLE_DENY);
+    ASSERT_TRUE(whole->subrangeList());
+    EXPECT_EQ(whole->subrangeList()->nodes(), (std::vector<RKRangeListNode>{
+                                                  {0, P, P, 0, 0, 0, 0},
+                                                  {T / 2, 3 * P, 2 * P, 0, P, 0, 0},
+                                                  {T - P, P, P, 0, 0, 0, 0},
+                                              }));
+    EXPECT_EQ(platform->callCount("pageRangeQuery"), 6u);
 }
 
 TEST_F(RKUserProcessPagesTest, PartialPagesAreChargedTheirBytesAndQueriedOnce) {
