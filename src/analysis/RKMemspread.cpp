@@ -6,6 +6,7 @@
 
 #include "analysis/RKCancelSource.h"
 #include "analysis/RKWorkerPool.h"
+#include "process/RKGatherScope.h"
 #include "process/RKUserProcess.h"
 
 namespace {
@@ -49,6 +50,7 @@ void RKMemspread::_addUnheldMemoryWarnings(const RKProcessList& sortedByPidDesc)
 
 bool RKMemspread::gatherData() {
     RKProcessList sorted = _processesBySortingPidDesc(processes_);
+    RKGatherScope gather;
     gatherStartTime_ = RKTime::now();
     std::atomic<bool> cancelled{false};
     RKWorkerPoolOptions options;

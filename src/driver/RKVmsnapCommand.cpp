@@ -20,6 +20,7 @@
 #include "analysis/RKWorkerPool.h"
 #include "platform/RKPlatform.h"
 #include "process/RKAnalysisSettings.h"
+#include "process/RKGatherScope.h"
 #include "process/RKProcess.h"
 #include "process/RKUserProcess.h"
 #include "process/RKVmsnapCapture.h"
@@ -184,6 +185,7 @@ int RKVmsnapMain(int argc, char** argv) {
     RKWorkerPoolOptions pool;
     pool.threads = RKOnlineCpuCount();
     pool.niceIncrement = kNiceUtility;
+    RKGatherScope gather;
     RKParallelApply(jobs.size(), pool, [&](size_t i) {
         Job& job = jobs[i];
         job.process->gatherData();

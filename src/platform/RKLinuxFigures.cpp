@@ -51,11 +51,18 @@ int RKLinuxPlatform::ledgerEntries(RKTask& task, std::vector<int64_t>& balances)
 }
 
 int RKLinuxPlatform::sysVSegments(std::vector<RKSysVSegment>& segments) {
-    return RKReadSysVSegments(procRoot(), segments);
+    std::shared_ptr<const std::vector<RKSysVSegment>> table;
+    const int error = sysV_->segments(table);
+    if (error == 0) segments = *table;
+    return error;
 }
+
+void RKLinuxPlatform::beginGather() { sysV_->begin(); }
+
+void RKLinuxPlatform::endGather() { sysV_->end(); }
 
 int RKLinuxPlatform::ownedVmObjects(RKTask& task, std::vector<RKOwnedVmObjectRecord>& records) {
     auto* target = dynamic_cast<RKLinuxTask*>(&task);
     if (!target) return EINVAL;
-    return RKReadOwnedObjects(*target, procRoot(), kernelPageSize(), records);
+    return RKReadOwnedObjects(*target, procRoot(), kernelPageSize(), *sysV_, records);
 }

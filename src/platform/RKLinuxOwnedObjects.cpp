@@ -11,7 +11,6 @@
 #include <atomic>
 #include <cerrno>
 #include <charconv>
-#include <chrono>
 #include <cstdio>
 #include <cstring>
 #include <memory>
@@ -45,30 +44,6 @@ std::atomic<bool> gNoCachestat{false};
 
 // The purge state word of a record: shmem is never purgeable.
 constexpr uint32_t kNotPurgeable = static_cast<uint32_t>(VM_PURGABLE_DENY) << 4;
-
-// The SysV table is the system's, not a process's: read once for all the processes measured
-// at nearly the same moment, so that measuring every process does not read it once per process.
-constexpr auto kSysVTableLifetime = std::chrono::milliseconds(250);
-
-struct RKSysVTableCache {
-    std::mutex mutex;
-    std::string procRoot;
-    std::chrono::steady_clock::time_point readAt;
-    std::shared_ptr<const std::vector<RKSysVSegment>> segments;
-};
-
-std::shared_ptr<const std::vector<RKSysVSegment>> sysVSegments(const std::string& procRoot) {
-    static RKSysVTableCache cache;
-    std::lock_guard<std::mutex> lock(cache.mutex);
-    auto now = std::chrono::steady_clock::now();
-    if (cache.segments && cache.procRoot == procRoot && now - cache.readAt < kSysVTableLifetime) return cache.segments;
-    std::vector<RKSysVSegment> segments;
-    RKReadSysVSegments(procRoot, segments);  // none when it cannot be read
-    cache.segments = std::make_shared<const std::vector<RKSysVSegment>>(std::move(segments));
-    cache.procRoot = procRoot;
-    cache.readAt = now;
-    return cache.segments;
-}
 
 uint64_t namespaceInode(const std::string& path) {
     struct stat st {};
@@ -113,9 +88,9 @@ enum class RKHeldKind { None, Shmem, Hugetlb };
 // One process's descriptors, read through its /proc directory.
 class RKDescriptorScan {
 public:
-    RKDescriptorScan(RKLinuxTask& task, const std::string& procRoot, uint64_t pageSize,
+    RKDescriptorScan(RKLinuxTask& task, const std::string& procRoot, uint64_t pageSize, RKSysVTableOfGather& sysV,
                      std::vector<RKOwnedVmObjectRecord>& records)
-        : task_(task), procRoot_(procRoot), pageSize_(pageSize), records_(records) {}
+        : task_(task), procRoot_(procRoot), pageSize_(pageSize), sysV_(sysV), records_(records) {}
 
     int run();
 
@@ -129,6 +104,7 @@ private:
     RKLinuxTask& task_;
     const std::string& procRoot_;
     uint64_t pageSize_;
+    RKSysVTableOfGather& sysV_;
     std::vector<RKOwnedVmObjectRecord>& records_;
     std::unordered_set<uint64_t> seen_;  // object ids already recorded
     std::shared_ptr<const RKMountTable> mounts_;
@@ -236,7 +212,8 @@ void RKDescriptorScan::addSysVSegments() {
     static const uint64_t ownNamespace = namespaceInode("/proc/self/ns/ipc");
     uint64_t targetNamespace = namespaceInode(task_.directoryFd(), "ns/ipc");
     if (ownNamespace == 0 || targetNamespace != ownNamespace) return;
-    auto segments = sysVSegments(procRoot_);
+    std::shared_ptr<const std::vector<RKSysVSegment>> segments;
+    sysV_.segments(segments);  // none when the table cannot be read
     for (const RKSysVSegment& segment : *segments) {
         if (segment.creator != task_.pid() || segment.attached != 0) continue;
         uint64_t id = RKObjectIdForFile(RKObjectKindSysV, targetNamespace, static_cast<uint64_t>(segment.shmid));
@@ -261,8 +238,31 @@ int RKReadSysVSegments(const std::string& procRoot, std::vector<RKSysVSegment>& 
     return 0;
 }
 
-int RKReadOwnedObjects(RKLinuxTask& task, const std::string& procRoot, uint64_t pageSize,
+void RKSysVTableOfGather::begin() {
+    std::lock_guard lock(mutex_);
+    if (gathers_++ == 0) table_.reset();  // a new gather reads the table anew
+}
+
+void RKSysVTableOfGather::end() {
+    std::lock_guard lock(mutex_);
+    if (gathers_ > 0 && --gathers_ == 0) table_.reset();
+}
+
+int RKSysVTableOfGather::segments(std::shared_ptr<const std::vector<RKSysVSegment>>& table) {
+    std::lock_guard lock(mutex_);
+    if (gathers_ > 0 && table_) {
+        table = table_;
+        return error_;
+    }
+    std::vector<RKSysVSegment> read;
+    const int error = RKReadSysVSegments(procRoot_, read);
+    table = std::make_shared<const std::vector<RKSysVSegment>>(std::move(read));
+    if (gathers_ > 0) table_ = table, error_ = error;
+    return error;
+}
+
+int RKReadOwnedObjects(RKLinuxTask& task, const std::string& procRoot, uint64_t pageSize, RKSysVTableOfGather& sysV,
                        std::vector<RKOwnedVmObjectRecord>& records) {
     records.clear();
-    return RKDescriptorScan(task, procRoot, pageSize, records).run();
+    return RKDescriptorScan(task, procRoot, pageSize, sysV, records).run();
 }

@@ -4,6 +4,8 @@
 // object id the region walk gives a mapping of the same object.
 #pragma once
 
+#include <memory>
+#include <mutex>
 #include <string>
 #include <vector>
 
@@ -19,7 +21,28 @@ inline constexpr uint32_t RKLedgerTagGraphics = 4;
 // The system's SysV segments (/proc/sysvipc/shm under `procRoot`): 0, or the errno.
 int RKReadSysVSegments(const std::string& procRoot, std::vector<RKSysVSegment>& segments);
 
+// The SysV table as one gather sees it: the system's, not a process's, so read once while a
+// gather is under way (the first process that needs it reads it, the others share that
+// reading) and afresh on every use outside one. Safe to use from the gather's workers.
+class RKSysVTableOfGather {
+public:
+    explicit RKSysVTableOfGather(std::string procRoot) : procRoot_(std::move(procRoot)) {}
+    // Gathers may overlap: the table is kept until the last one ends.
+    void begin();
+    void end();
+    // 0 and the segments (none when the table cannot be read), or the errno of its read.
+    int segments(std::shared_ptr<const std::vector<RKSysVSegment>>& table);
+
+private:
+    const std::string procRoot_;
+    std::mutex mutex_;
+    int gathers_ = 0;
+    std::shared_ptr<const std::vector<RKSysVSegment>> table_;  // read within the gathers
+    int error_ = 0;
+};
+
 // 0 and the records; EACCES or EPERM when the descriptors may not be read; ESRCH when the
-// process is gone. `procRoot` is where the system's sysvipc table is read.
-int RKReadOwnedObjects(RKLinuxTask& task, const std::string& procRoot, uint64_t pageSize,
+// process is gone. `procRoot` is the /proc the process is read under; `sysV`, the table its
+// segments come from.
+int RKReadOwnedObjects(RKLinuxTask& task, const std::string& procRoot, uint64_t pageSize, RKSysVTableOfGather& sysV,
                        std::vector<RKOwnedVmObjectRecord>& records);

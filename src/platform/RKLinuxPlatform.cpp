@@ -11,6 +11,7 @@
 #include <chrono>
 
 #include "platform/RKDescriptorBudget.h"
+#include "platform/RKLinuxOwnedObjects.h"
 #include "platform/RKLinuxTask.h"
 
 namespace {
@@ -41,7 +42,9 @@ void raiseDescriptorLimit() {
 }  // namespace
 
 RKLinuxPlatform::RKLinuxPlatform(std::string procRoot, std::string sysRoot)
-    : procRoot_(std::move(procRoot)), sysRoot_(std::move(sysRoot)) {
+    : procRoot_(std::move(procRoot)),
+      sysRoot_(std::move(sysRoot)),
+      sysV_(std::make_shared<RKSysVTableOfGather>(procRoot_)) {
     static const bool raised = (raiseDescriptorLimit(), true);
     (void)raised;
 }

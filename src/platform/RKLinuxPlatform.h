@@ -2,9 +2,12 @@
 // The roots are injectable so the readers can be tested on small fake trees.
 #pragma once
 
+#include <memory>
 #include <string>
 
 #include "platform/RKPlatform.h"
+
+class RKSysVTableOfGather;
 
 class RKLinuxPlatform : public RKPlatform {
 public:
@@ -50,6 +53,8 @@ public:
     int ledgerEntries(RKTask& task, std::vector<int64_t>& balances) override;
     int ownedVmObjects(RKTask& task, std::vector<RKOwnedVmObjectRecord>& records) override;
     int sysVSegments(std::vector<RKSysVSegment>& segments) override;
+    void beginGather() override;
+    void endGather() override;
 
     // The kernel (RKLinuxKernelMemoryReader.cpp).
     kern_return_t memoryInfo(RKKernelMemoryInfo& info) override;
@@ -69,4 +74,5 @@ public:
 private:
     std::string procRoot_;
     std::string sysRoot_;
+    std::shared_ptr<RKSysVTableOfGather> sysV_;  // read once a gather (RKLinuxOwnedObjects.cpp)
 };

@@ -22,22 +22,31 @@ const RKLinuxRegion* regionContaining(const RKLinuxWalkSnapshot& snapshot, uint6
     return region && region->vma.start <= address ? region : nullptr;
 }
 
+// Anonymous pages of a private mapping that other mappings hold too, in kB: every shared page of
+// anonymous memory; of a file or shmem object, the shared copies written through the mapping
+// (dirty, and no more than its anonymous pages: its page cache is no anonymous memory).
+uint64_t sharedAnonymousKB(const RKLinuxRegion& region) {
+    if (region.vma.perms & RKSmapsShared) return 0;
+    switch (region.kind) {
+        case RKVmaKind::Anonymous: return region.vma.sharedClean + region.vma.sharedDirty;
+        case RKVmaKind::File:
+        case RKVmaKind::Shmem: return std::min(region.vma.sharedDirty, region.vma.anonymous);
+        default: return 0;
+    }
+}
+
 void rememberSharedAnonymous(RKLinuxTask& task) {
     task.sharedAnonymousBytes.clear();
-    for (const RKLinuxRegion& region : task.snapshot->regions) {
-        const uint64_t shared = (region.vma.sharedClean + region.vma.sharedDirty) * 1024;
-        if (region.kind == RKVmaKind::Anonymous && !(region.vma.perms & RKSmapsShared) && shared > 0)
+    for (const RKLinuxRegion& region : task.snapshot->regions)
+        if (const uint64_t shared = sharedAnonymousKB(region) * 1024)
             task.sharedAnonymousBytes.emplace_back(region.vma.start, shared);
-    }
 }
 
 // Loads a snapshot when none is held, or always when `fresh` (a walk starting over).
 kern_return_t ensureSnapshot(RKLinuxPlatform& platform, RKLinuxTask& task, bool fresh) {
     if (task.snapshot && !fresh) return KERN_SUCCESS;
     RKRecycleWalkSnapshot(std::move(task.snapshot));
-    kern_return_t result = RKLoadWalkSnapshot(task, platform.procRoot(), platform.kernelPageSize(), task.snapshot);
-    if (result == KERN_SUCCESS) rememberSharedAnonymous(task);
-    return result;
+    return RKLoadWalkSnapshot(task, platform.procRoot(), platform.kernelPageSize(), task.snapshot);
 }
 
 }  // namespace
@@ -46,9 +55,13 @@ kern_return_t RKLinuxPlatform::regionRecurse(RKTask& task, uint64_t& address, ui
                                              RKRegionSubmapInfo& info, uint32_t& count) {
     RKLinuxTask* target = linuxTask(task);
     if (!target) return KERN_INVALID_ARGUMENT;
-    bool fresh = address == 0 && !(target->snapshot && target->snapshot->readyForWalk);
+    const bool starting = address == 0;
+    bool fresh = starting && !(target->snapshot && target->snapshot->readyForWalk);
     kern_return_t result = ensureSnapshot(*this, *target, fresh);
     if (result != KERN_SUCCESS) return result;
+    // Whoever read it (this walk, or the image lister just before), the walk's snapshot is the
+    // one the bound of unattributable shared pages comes from.
+    if (starting) rememberSharedAnonymous(*target);
     target->snapshot->readyForWalk = false;
     const RKLinuxRegion* region = regionEndingAbove(*target->snapshot, address);
     if (!region) {

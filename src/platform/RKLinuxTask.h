@@ -48,9 +48,9 @@ public:
     std::unique_ptr<RKLinuxWalkSnapshot> snapshot;
     // Page data read ahead for the page queries that follow (RKLinuxPages.cpp).
     std::unique_ptr<RKLinuxPageData> pageData;
-    // Start and shared bytes (smaps Shared_Clean + Shared_Dirty) of every private anonymous
-    // VMA with shared pages, as the latest walk saw them; kept after the walk, for the bound of
-    // what cannot be attributed where frames are hidden.
+    // Start and shared anonymous bytes (from smaps, RKLinuxRegions.cpp) of every private VMA
+    // with such pages, as the latest walk saw them; kept after the walk, for the bound of what
+    // cannot be attributed where frames are hidden.
     std::vector<std::pair<uint64_t, uint64_t>> sharedAnonymousBytes;
 
 private:

@@ -126,6 +126,11 @@ public:
     // The system's SysV shared memory segments (those memspread's IPC namespace shows): 0, or
     // the errno.
     virtual int sysVSegments(std::vector<RKSysVSegment>& segments) = 0;
+    // One gather of every measured process begins or ends (process/RKGatherScope.h): what is the
+    // system's rather than a process's (the SysV table) is read once within it. Gathers may
+    // overlap; the outermost one decides.
+    virtual void beginGather() {}
+    virtual void endGather() {}
 
     // ---- The kernel ----
     // mach_memory_info: KERN_SUCCESS and the kernel's zones, wired sites, counters and loaded

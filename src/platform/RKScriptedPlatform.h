@@ -136,6 +136,8 @@ public:
     int ledgerEntries(RKTask& task, std::vector<int64_t>& balances) override;
     int ownedVmObjects(RKTask& task, std::vector<RKOwnedVmObjectRecord>& records) override;
     int sysVSegments(std::vector<RKSysVSegment>& segments) override;
+    void beginGather() override { record("beginGather"); }
+    void endGather() override { record("endGather"); }
     kern_return_t memoryInfo(RKKernelMemoryInfo& info) override;
     int readSelfRegionMemspread(int32_t& value) override;
     int writeSelfRegionMemspread(int32_t value) override;

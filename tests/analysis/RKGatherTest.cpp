@@ -23,10 +23,13 @@ struct RKRecordingProcess : RKProcess {
     int gathered = 0;
     int niceness = 0;
     size_t stampsBefore = 0;
+    size_t gathersOpen = 0;
     void gatherData() override {
         gathered++;
         niceness = ownNiceness();
-        stampsBefore = dynamic_cast<RKScriptedPlatform&>(RKPlatform::current()).callCount("getTimes");
+        auto& platform = dynamic_cast<RKScriptedPlatform&>(RKPlatform::current());
+        stampsBefore = platform.callCount("getTimes");
+        gathersOpen = platform.callCount("beginGather") - platform.callCount("endGather");
     }
 };
 
@@ -94,8 +97,10 @@ TEST(RKGather, EveryProcessIsGatheredOnceOnNicedWorkersBetweenTheStamps) {
     for (const auto& process : g.processes) {
         EXPECT_EQ(process->gathered, 1);
         EXPECT_EQ(process->stampsBefore, 1u) << "not gathered between the start and the end stamp";
+        EXPECT_EQ(process->gathersOpen, 1u) << "not within the one gather the platform was told of";
         EXPECT_EQ(process->niceness, std::min(ownNiceness() + 5, 19)) << "not on a worker niced by 5";
     }
+    EXPECT_EQ(g.platform->callCount("endGather"), 1u);
     // User-initiated gathering runs at the caller's own priority.
     RKMemspread sampling({g.processes[0]});
     sampling.setQualityOfService(QOS_CLASS_USER_INITIATED);

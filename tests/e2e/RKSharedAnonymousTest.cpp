@@ -65,8 +65,10 @@ TEST(RKSharedAnonymous, ForkedWorkersShareTheirParentsMemoryOnce) {
         EXPECT_EQ(std::stoull(match[1]), kernel);
     }
     auto summary = RKDirtyByCategory(report, "Summary Memspread: ");
-    // Anonymous pages live in these categories (a private file mapping's copies under its file).
-    const uint64_t anonymous = summary["anonymous"] + summary["heap"] + summary["stack"] + summary["mapped file"];
+    // Anonymous pages in the kernel's sense live in these categories: a private file mapping's
+    // copies are under its image segment (relocated ".data", ".data.rel.ro") or its file.
+    const uint64_t anonymous = summary["anonymous"] + summary["heap"] + summary["stack"] + summary[".data"] +
+                               summary[".data.rel.ro"] + summary["mapped file"];
     EXPECT_NEAR(static_cast<double>(anonymous), static_cast<double>(pssAnon), 0.01 * static_cast<double>(pssAnon))
         << report.substr(report.find("Summary Memspread: "));
 
