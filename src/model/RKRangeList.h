@@ -17,7 +17,6 @@
 
 #include <cstddef>
 #include <cstdint>
-#include <deque>
 #include <vector>
 
 #include "model/RKMemoryTotal.h"
@@ -62,9 +61,11 @@ private:
     void _placeQueued() const;
 
     // Placed nodes in ascending order, then the queued insertions in insertion order, all with
-    // queuedPageSize_. Reads place the queue first, hence mutable. A deque grows without
-    // copying, and placing sorts and compacts it in place: large lists cost their nodes once.
-    mutable std::deque<Entry> entries_;
+    // queuedPageSize_. Reads place the queue first, hence mutable. A vector, not a deque: most
+    // lists hold one node (one per region and per private object, hundreds of thousands at
+    // once), and a deque allocates a 512-byte block and its map even when empty. Placing sorts
+    // and compacts in place.
+    mutable std::vector<Entry> entries_;
     mutable uint64_t queuedCount_ = 0;
     mutable uint64_t queuedPageSize_ = 0;
 };
