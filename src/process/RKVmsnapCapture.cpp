@@ -4,6 +4,7 @@
 #include "process/RKVmsnapCapture.h"
 
 #include <set>
+#include <unordered_map>
 
 #include "model/RKMemoryRegion.h"
 #include "model/RKRangeList.h"
@@ -55,6 +56,24 @@ RKVmsnapRegion regionRecord(const RKMemoryRegion& region) {
     return record;
 }
 
+// The process's shared anonymous pages as runs of consecutive keys in one saved region: forked
+// memory is mostly contiguous in frames, so runs keep the list short.
+void captureSharedAnonymousPages(const RKUserProcess& process,
+                                 const std::unordered_map<const RKMemoryRegion*, uint32_t>& savedIndex,
+                                 RKVmsnapGraph& graph) {
+    const auto& regions = process.sharedAnonymousRegions();
+    for (const RKSharedAnonymousPage& page : process.sharedAnonymousPages()) {
+        if (page.range >= regions.size()) continue;
+        auto found = savedIndex.find(regions[page.range].get());
+        if (found == savedIndex.end()) continue;
+        auto& runs = graph.sharedAnonymousPages;
+        if (!runs.empty() && runs.back().region == found->second && runs.back().page + runs.back().count == page.page)
+            runs.back().count++;
+        else
+            runs.push_back({page.page, 1, found->second});
+    }
+}
+
 }  // namespace
 
 RKVmsnapGraph RKVmsnapGraphForProcess(const RKUserProcess& process, const std::string& description) {
@@ -68,6 +87,7 @@ RKVmsnapGraph RKVmsnapGraphForProcess(const RKUserProcess& process, const std::s
     graph.physicalMemspreadPeak = process.phys_memspread_peak();
     graph.showsPhysMemspread = process.breakDownPhysMemspread();
     std::set<std::string> images;
+    std::unordered_map<const RKMemoryRegion*, uint32_t> savedIndex;
     for (const auto& region : process.memoryRegions().value_or(RKRegionList{})) {
         if (region->start == RKRegionNoAddress) {
             RKVmsnapUnaddressedRegion record;
@@ -81,8 +101,11 @@ RKVmsnapGraph RKVmsnapGraphForProcess(const RKUserProcess& process, const std::s
             continue;
         }
         if (isImageSegment(*region)) images.insert(region->detailedName);
+        savedIndex.emplace(region.get(), static_cast<uint32_t>(graph.regions.size()));
         graph.regions.push_back(regionRecord(*region));
     }
     for (const std::string& image : images) graph.binaryImagesDescription += image + "\n";
+    captureSharedAnonymousPages(process, savedIndex, graph);
+    graph.unattributedSharedAnonymousBytes = process.unattributedSharedAnonymousBytes();
     return graph;
 }

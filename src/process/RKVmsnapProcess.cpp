@@ -6,6 +6,7 @@
 
 #include <cerrno>
 #include <cstring>
+#include <unordered_map>
 
 #include "model/RKAssert.h"
 #include "model/RKMemoryRegion.h"
@@ -203,7 +204,36 @@ void RKVmsnapProcess::enumerateRegions(const RKRegionCallback& callback) {
 }
 
 void RKVmsnapProcess::_completeRegion(RKMemoryRegion& region) {
-    if (current_ && current_->details) applyDetails(region, *current_->details, pageSize());
+    if (!current_) return;
+    if (current_->details) applyDetails(region, *current_->details, pageSize());
+    builtRegions_.resize(graph_.regions.size(), nullptr);
+    builtRegions_[static_cast<size_t>(current_ - graph_.regions.data())] = &region;
+}
+
+void RKVmsnapProcess::_gatherSharedAnonymousPages(RKRegionWalkState& state) {
+    std::vector<const RKMemoryRegion*> built = std::move(builtRegions_);
+    builtRegions_.clear();
+    // Where the live walk would note no region, the snapshot brings no pages either.
+    if (state.hidden || state.sharingAnalysisDisabled) return;
+    unattributedSharedAnonymousBytes_ = graph_.unattributedSharedAnonymousBytes;
+    if (graph_.sharedAnonymousPages.empty()) return;
+    std::unordered_map<const RKMemoryRegion*, std::shared_ptr<RKMemoryRegion>> owner;
+    for (const auto& region : state.regions) owner.emplace(region.get(), region);
+    std::vector<int64_t> rangeOfSaved(graph_.regions.size(), -1);  // saved region -> range, or -1
+    sharedAnonymousPages_.clear();
+    sharedAnonymousRegions_.clear();
+    for (const RKVmsnapSharedPageRun& run : graph_.sharedAnonymousPages) {
+        int64_t& range = rangeOfSaved[run.region];
+        if (range < 0) {
+            auto found = owner.find(run.region < built.size() ? built[run.region] : nullptr);
+            if (found == owner.end()) continue;  // the walk made no region of it
+            range = static_cast<int64_t>(sharedAnonymousRegions_.size());
+            sharedAnonymousRegions_.push_back(found->second);
+        }
+        const uint32_t swapped = (run.page & RKSwappedPageKey) ? 1 : 0;
+        for (uint64_t i = 0; i < run.count; i++)
+            sharedAnonymousPages_.push_back({(run.page + i) | RKVmsnapPageKeyMark, static_cast<uint32_t>(range), swapped});
+    }
 }
 
 void RKVmsnapProcess::_addUnconsumedOwnedObjectRegions(RKRegionWalkState& state) {

@@ -5,6 +5,7 @@
 
 #include <limits>
 
+#include "platform/RKKernelTypes.h"
 #include "process/RKVmsnapCompression.h"
 #include "process/RKVmsnapGraph.h"
 
@@ -15,6 +16,9 @@ using Json = nlohmann::json;
 // The largest text a snapshot may decompress to: far above any process seen (a few MB), low
 // enough that a forged size cannot exhaust memory.
 constexpr size_t kTextLimit = size_t{1} << 31;
+// The most shared anonymous pages a snapshot may list (64 GiB of 4 KiB pages): each becomes a
+// 16-byte record, so a forged count must not decide how much memory a read takes.
+constexpr uint64_t kSharedPageLimit = uint64_t{1} << 24;
 
 struct ParseFailure {
     std::string reason;
@@ -155,6 +159,37 @@ RKVmsnapUnaddressedRegion readUnaddressed(const Json& value, const std::string& 
     return region;
 }
 
+// Runs of shared pages: ascending (a page may repeat only where one process maps it twice), in
+// a saved region, no more of them in a region than it has pages.
+void readSharedPages(const Json& runs, RKVmsnapGraph& graph) {
+    std::vector<uint64_t> pagesPerRegion(graph.regions.size(), 0);
+    uint64_t total = 0, previousLast = 0;
+    for (size_t i = 0; i < runs.size(); i++) {
+        const std::string where = "shared page run " + std::to_string(i) + " ";
+        const Json& value = runs[i];
+        if (!value.is_array() || value.size() != 3) fail(where, "is not an array of 3 numbers");
+        for (size_t k = 0; k < 3; k++)
+            if (!value[k].is_number_unsigned()) fail(where, "holds a value that is not an unsigned integer");
+        RKVmsnapSharedPageRun run{value[0].get<uint64_t>(), value[1].get<uint64_t>(), 0};
+        const uint64_t region = value[2].get<uint64_t>();
+        if (region >= graph.regions.size()) fail(where, "names a region the snapshot does not have");
+        run.region = static_cast<uint32_t>(region);
+        if (run.count == 0) fail(where, "is empty");
+        const uint64_t last = run.page + (run.count - 1);
+        if (last < run.page || ((run.page | last) & RKVmsnapPageKeyMark) != 0 ||
+            ((run.page ^ last) & RKSwappedPageKey) != 0)
+            fail(where, "is not a run of frame numbers or swap entries");
+        if (i > 0 && run.page < previousLast) fail(where, "precedes the run before it");
+        const uint64_t regionPages = graph.regions[region].length / graph.vmPageSize + 1;
+        if (run.count > regionPages || (pagesPerRegion[region] += run.count) > regionPages)
+            fail(where, "holds more pages than its region");
+        total += run.count;
+        if (total > kSharedPageLimit) fail(where, "is past the most shared pages a snapshot may hold");
+        previousLast = last;
+        graph.sharedAnonymousPages.push_back(run);
+    }
+}
+
 RKVmsnapGraph readGraph(const Json& document) {
     const std::string top;
     if (!document.is_object()) fail(top, "not a vmsnap (the document is not an object)");
@@ -194,6 +229,8 @@ RKVmsnapGraph readGraph(const Json& document) {
         for (size_t i = 0; i < regions->size(); i++)
             graph.unaddressedRegions.push_back(readUnaddressed((*regions)[i], "unaddressed region " + std::to_string(i) + " "));
     }
+    if (const Json* runs = arrayMember(document, "sharedAnonymousPages", top)) readSharedPages(*runs, graph);
+    graph.unattributedSharedAnonymousBytes = unsignedMember(document, "unattributedSharedAnonymousBytes", top);
     return graph;
 }
 

@@ -89,6 +89,12 @@ std::string RKVmsnapSerialize(const RKVmsnapGraph& graph) {
         unaddressed.push_back(std::move(object));
     }
     document["unaddressedRegions"] = std::move(unaddressed);
+    if (!graph.sharedAnonymousPages.empty()) {
+        Json runs = Json::array();
+        for (const RKVmsnapSharedPageRun& run : graph.sharedAnonymousPages) runs.push_back({run.page, run.count, run.region});
+        document["sharedAnonymousPages"] = std::move(runs);
+    }
+    put(document, "unattributedSharedAnonymousBytes", graph.unattributedSharedAnonymousBytes);
     // Names and paths come from other processes and need not be UTF-8: replace what is not.
     return RKVmsnapCompress(document.dump(-1, ' ', false, Json::error_handler_t::replace) + "\n");
 }
