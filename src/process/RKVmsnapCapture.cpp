@@ -56,21 +56,23 @@ RKVmsnapRegion regionRecord(const RKMemoryRegion& region) {
     return record;
 }
 
-// The process's shared anonymous pages as runs of consecutive keys in one saved region: forked
-// memory is mostly contiguous in frames, so runs keep the list short.
+// The process's shared anonymous pages, region by region. The query's list is sorted by key, so
+// each region's keys come out ascending.
 void captureSharedAnonymousPages(const RKUserProcess& process,
                                  const std::unordered_map<const RKMemoryRegion*, uint32_t>& savedIndex,
                                  RKVmsnapGraph& graph) {
     const auto& regions = process.sharedAnonymousRegions();
+    std::vector<int64_t> listOfRange(regions.size(), -1);
     for (const RKSharedAnonymousPage& page : process.sharedAnonymousPages()) {
         if (page.range >= regions.size()) continue;
-        auto found = savedIndex.find(regions[page.range].get());
-        if (found == savedIndex.end()) continue;
-        auto& runs = graph.sharedAnonymousPages;
-        if (!runs.empty() && runs.back().region == found->second && runs.back().page + runs.back().count == page.page)
-            runs.back().count++;
-        else
-            runs.push_back({page.page, 1, found->second});
+        int64_t& list = listOfRange[page.range];
+        if (list < 0) {
+            auto found = savedIndex.find(regions[page.range].get());
+            if (found == savedIndex.end()) continue;
+            list = static_cast<int64_t>(graph.sharedAnonymousPages.size());
+            graph.sharedAnonymousPages.push_back({found->second, {}});
+        }
+        graph.sharedAnonymousPages[static_cast<size_t>(list)].keys.push_back(page.page);
     }
 }
 

@@ -76,13 +76,12 @@ struct RKVmsnapUnaddressedRegion {
     RKVmsnapRegionDetails details;
 };
 
-// Consecutive shared anonymous pages of one saved region: `count` page keys from `page` on (a
-// frame number, or a swap entry with RKSwappedPageKey set), as the platform's shared-page query
-// answered them. `region` indexes the graph's regions.
-struct RKVmsnapSharedPageRun {
-    uint64_t page = 0;
-    uint64_t count = 0;
+// The shared anonymous pages of one saved region, as the platform's shared-page query answered
+// them: their keys (a frame number, or a swap entry with RKSwappedPageKey set), ascending; a key
+// repeats where the region maps one page twice (KSM). `region` indexes the graph's regions.
+struct RKVmsnapSharedPages {
     uint32_t region = 0;
+    std::vector<uint64_t> keys;
 };
 
 // A key bit no frame number or swap entry uses: a snapshot's pages carry it once read, so they
@@ -103,8 +102,8 @@ struct RKVmsnapGraph {
     std::vector<RKVmsnapRegion> regions;  // ascending by address
     std::vector<RKVmsnapUnaddressedRegion> unaddressedRegions;
     // The input of the pass that counts fork-shared anonymous pages once, so that snapshots
-    // analysed together share them as the live processes do. Ascending by page.
-    std::vector<RKVmsnapSharedPageRun> sharedAnonymousPages;
+    // analysed together share them as the live processes do.
+    std::vector<RKVmsnapSharedPages> sharedAnonymousPages;
     uint64_t unattributedSharedAnonymousBytes = 0;  // frames were hidden: bytes shared, unattributed
 };
 

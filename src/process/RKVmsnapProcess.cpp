@@ -4,6 +4,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <unordered_map>
@@ -222,18 +223,21 @@ void RKVmsnapProcess::_gatherSharedAnonymousPages(RKRegionWalkState& state) {
     std::vector<int64_t> rangeOfSaved(graph_.regions.size(), -1);  // saved region -> range, or -1
     sharedAnonymousPages_.clear();
     sharedAnonymousRegions_.clear();
-    for (const RKVmsnapSharedPageRun& run : graph_.sharedAnonymousPages) {
-        int64_t& range = rangeOfSaved[run.region];
+    for (const RKVmsnapSharedPages& pages : graph_.sharedAnonymousPages) {
+        int64_t& range = rangeOfSaved[pages.region];
         if (range < 0) {
-            auto found = owner.find(run.region < built.size() ? built[run.region] : nullptr);
+            auto found = owner.find(pages.region < built.size() ? built[pages.region] : nullptr);
             if (found == owner.end()) continue;  // the walk made no region of it
             range = static_cast<int64_t>(sharedAnonymousRegions_.size());
             sharedAnonymousRegions_.push_back(found->second);
         }
-        const uint32_t swapped = (run.page & RKSwappedPageKey) ? 1 : 0;
-        for (uint64_t i = 0; i < run.count; i++)
-            sharedAnonymousPages_.push_back({(run.page + i) | RKVmsnapPageKeyMark, static_cast<uint32_t>(range), swapped});
+        for (uint64_t key : pages.keys)
+            sharedAnonymousPages_.push_back(
+                {key | RKVmsnapPageKeyMark, static_cast<uint32_t>(range), (key & RKSwappedPageKey) ? 1u : 0u});
     }
+    // The pass merges every process's pages in key order.
+    std::sort(sharedAnonymousPages_.begin(), sharedAnonymousPages_.end(),
+              [](const RKSharedAnonymousPage& a, const RKSharedAnonymousPage& b) { return a.page < b.page; });
 }
 
 void RKVmsnapProcess::_addUnconsumedOwnedObjectRegions(RKRegionWalkState& state) {

@@ -159,34 +159,35 @@ RKVmsnapUnaddressedRegion readUnaddressed(const Json& value, const std::string& 
     return region;
 }
 
-// Runs of shared pages: ascending (a page may repeat only where one process maps it twice), in
-// a saved region, no more of them in a region than it has pages.
-void readSharedPages(const Json& runs, RKVmsnapGraph& graph) {
+// Each region's shared pages: [region, key, difference to the next key, ...], keys ascending,
+// each a frame number or a swap entry, no more of them in a region than it has pages.
+void readSharedPages(const Json& lists, RKVmsnapGraph& graph) {
     std::vector<uint64_t> pagesPerRegion(graph.regions.size(), 0);
-    uint64_t total = 0, previousLast = 0;
-    for (size_t i = 0; i < runs.size(); i++) {
-        const std::string where = "shared page run " + std::to_string(i) + " ";
-        const Json& value = runs[i];
-        if (!value.is_array() || value.size() != 3) fail(where, "is not an array of 3 numbers");
-        for (size_t k = 0; k < 3; k++)
-            if (!value[k].is_number_unsigned()) fail(where, "holds a value that is not an unsigned integer");
-        RKVmsnapSharedPageRun run{value[0].get<uint64_t>(), value[1].get<uint64_t>(), 0};
-        const uint64_t region = value[2].get<uint64_t>();
+    uint64_t total = 0;
+    for (size_t i = 0; i < lists.size(); i++) {
+        const std::string where = "shared pages " + std::to_string(i) + " ";
+        const Json& value = lists[i];
+        if (!value.is_array() || value.size() < 2) fail(where, "is not an array of a region and its pages");
+        for (const Json& number : value)
+            if (!number.is_number_unsigned()) fail(where, "holds a value that is not an unsigned integer");
+        const uint64_t region = value[0].get<uint64_t>();
         if (region >= graph.regions.size()) fail(where, "names a region the snapshot does not have");
-        run.region = static_cast<uint32_t>(region);
-        if (run.count == 0) fail(where, "is empty");
-        const uint64_t last = run.page + (run.count - 1);
-        if (last < run.page || ((run.page | last) & RKVmsnapPageKeyMark) != 0 ||
-            ((run.page ^ last) & RKSwappedPageKey) != 0)
-            fail(where, "is not a run of frame numbers or swap entries");
-        if (i > 0 && run.page < previousLast) fail(where, "precedes the run before it");
+        const uint64_t count = value.size() - 1;
         const uint64_t regionPages = graph.regions[region].length / graph.vmPageSize + 1;
-        if (run.count > regionPages || (pagesPerRegion[region] += run.count) > regionPages)
+        if (count > regionPages || (pagesPerRegion[region] += count) > regionPages)
             fail(where, "holds more pages than its region");
-        total += run.count;
-        if (total > kSharedPageLimit) fail(where, "is past the most shared pages a snapshot may hold");
-        previousLast = last;
-        graph.sharedAnonymousPages.push_back(run);
+        if ((total += count) > kSharedPageLimit) fail(where, "is past the most shared pages a snapshot may hold");
+        RKVmsnapSharedPages pages{static_cast<uint32_t>(region), {}};
+        pages.keys.reserve(count);
+        uint64_t key = 0;
+        for (size_t k = 1; k < value.size(); k++) {
+            const uint64_t difference = value[k].get<uint64_t>();
+            if (difference > std::numeric_limits<uint64_t>::max() - key) fail(where, "goes past the largest key");
+            key += difference;
+            if (key & RKVmsnapPageKeyMark) fail(where, "holds a key that is no frame number or swap entry");
+            pages.keys.push_back(key);
+        }
+        graph.sharedAnonymousPages.push_back(std::move(pages));
     }
 }
 

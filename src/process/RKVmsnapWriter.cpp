@@ -2,6 +2,8 @@
 // keeps files small and lets hand-made snapshots state only what matters.
 #include <nlohmann/json.hpp>
 
+#include <utility>
+
 #include "process/RKVmsnapCompression.h"
 #include "process/RKVmsnapGraph.h"
 
@@ -91,7 +93,14 @@ std::string RKVmsnapSerialize(const RKVmsnapGraph& graph) {
     document["unaddressedRegions"] = std::move(unaddressed);
     if (!graph.sharedAnonymousPages.empty()) {
         Json runs = Json::array();
-        for (const RKVmsnapSharedPageRun& run : graph.sharedAnonymousPages) runs.push_back({run.page, run.count, run.region});
+        // Keys as differences from the one before: frames of one region lie near each other,
+        // and small numbers are what keeps the list small.
+        for (const RKVmsnapSharedPages& pages : graph.sharedAnonymousPages) {
+            Json list = Json::array({pages.region});
+            uint64_t previous = 0;
+            for (uint64_t key : pages.keys) list.push_back(key - std::exchange(previous, key));
+            runs.push_back(std::move(list));
+        }
         document["sharedAnonymousPages"] = std::move(runs);
     }
     put(document, "unattributedSharedAnonymousBytes", graph.unattributedSharedAnonymousBytes);

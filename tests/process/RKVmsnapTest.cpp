@@ -57,7 +57,7 @@ TEST_F(RKVmsnapTest, GraphSurvivesTheFileCompressedAndEveryDamageIsAnError) {
     region.details = RKVmsnapRegionDetails{"heap", "", 0x2000, 0, 0x1000, 0, true, false, {{0, 0x2000, 0x2000, 0, 0, 0, 0x2000}}};
     graph.regions = {region};
     graph.unaddressedRegions = {{0x5000, 0, 0xFFFFFFFFFFFFFFFFull, 2, 0, {"page table", "", 0x5000, 0, 0, 0, false, false, {}}}};
-    graph.sharedAnonymousPages = {{100, 2, 0}, {RKSwappedPageKey | 7, 1, 0}};
+    graph.sharedAnonymousPages = {{0, {100, 101, 101, RKSwappedPageKey | 7}}};
     graph.unattributedSharedAnonymousBytes = 0x3000;
     const std::string bytes = RKVmsnapSerialize(graph);
     ASSERT_TRUE(RKVmsnapIsCompressed(bytes));
@@ -68,9 +68,8 @@ TEST_F(RKVmsnapTest, GraphSurvivesTheFileCompressedAndEveryDamageIsAnError) {
     EXPECT_EQ(back->regions[0].object_id, region.object_id);
     EXPECT_EQ(back->regions[0].details->subranges[0].wired, 0x2000u);
     EXPECT_EQ(back->unaddressedRegions[0].details.name, "page table");
-    ASSERT_EQ(back->sharedAnonymousPages.size(), 2u);
-    EXPECT_EQ(back->sharedAnonymousPages[0].count, 2u);
-    EXPECT_EQ(back->sharedAnonymousPages[1].page, RKSwappedPageKey | 7);
+    ASSERT_EQ(back->sharedAnonymousPages.size(), 1u);
+    EXPECT_EQ(back->sharedAnonymousPages[0].keys, graph.sharedAnonymousPages[0].keys);
     EXPECT_EQ(back->unattributedSharedAnonymousBytes, 0x3000u);
 
     const std::string plain = snapshot("Linux");
@@ -89,21 +88,19 @@ TEST_F(RKVmsnapTest, GraphSurvivesTheFileCompressedAndEveryDamageIsAnError) {
         {snapshot("Linux", R"([{"address":4096,"length":4096,"details":{"subranges":[[1,2]]}}])"), "subrange 0 is not an array of 7"},
         {snapshot("Linux").replace(snapshot("Linux").find("4096"), 4, "3000"), "\"vmPageSize\" is not a page size"},
     };
-    // Shared page runs: [page, count, region] over one region of 4 pages.
+    // Shared pages: [region, key, difference, ...] over one region of 4 pages.
     const auto runs = [](const std::string& list) {
         return snapshot("Linux", R"([{"address":4096,"length":16384}])", R"(,"sharedAnonymousPages":)" + list);
     };
     const std::pair<std::string, std::string> badRuns[] = {
-        {runs("[[1,1]]"), "shared page run 0 is not an array of 3"},
-        {runs("[[1,-1,0]]"), "not an unsigned integer"},
-        {runs("[[1,1,1]]"), "names a region the snapshot does not have"},
-        {runs("[[1,0,0]]"), "is empty"},
-        {runs("[[5,1,0],[3,1,0]]"), "shared page run 1 precedes"},
-        {runs("[[4611686018427387904,1,0]]"), "is not a run of frame numbers or swap entries"},
-        {runs("[[9223372036854775807,2,0]]"), "is not a run of frame numbers or swap entries"},
-        {runs("[[18446744073709551615,2,0]]"), "is not a run of frame numbers or swap entries"},
-        {runs("[[1,6,0]]"), "holds more pages than its region"},
-        {runs("[[1,3,0],[10,3,0]]"), "shared page run 1 holds more pages than its region"},
+        {runs("[[0]]"), "shared pages 0 is not an array of a region and its pages"},
+        {runs("[[0,5,-1]]"), "not an unsigned integer"},
+        {runs("[[1,5]]"), "names a region the snapshot does not have"},
+        {runs("[[0,4611686018427387904]]"), "holds a key that is no frame number"},
+        {runs("[[0,9223372036854775807,9223372036854775807]]"), "holds a key that is no frame number"},
+        {runs("[[0,9223372036854775808,9223372036854775808]]"), "goes past the largest key"},
+        {runs("[[0,1,1,1,1,1,1]]"), "holds more pages than its region"},
+        {runs("[[0,1,1,1],[0,9,1,1]]"), "shared pages 1 holds more pages than its region"},
         {runs("{}"), "\"sharedAnonymousPages\" is not an array"},
     };
     for (const auto& cases : {std::vector(std::begin(damaged), std::end(damaged)),
@@ -211,11 +208,12 @@ TEST_F(RKVmsnapTest, SavedSharedPagesMeetAcrossSnapshotsAsLiveFramesDo) {
     const std::string parentRegions = R"([{"address":4096,"length":4096,"details":{"name":"stack"}},
         {"address":65536,"length":16384,)" + heap + "}]";
     const std::string childRegions = R"([{"address":65536,"length":16384,)" + heap + "}]";
-    const std::string swapped = std::to_string(RKSwappedPageKey | 9);
     auto pair = [&](bool withPages) {
         std::vector<std::shared_ptr<RKProcess>> processes;
-        for (const auto& [regions, pages] : {std::pair{parentRegions, "[[100,1,1],[" + swapped + ",1,1]]"},
-                                             std::pair{childRegions, "[[100,2,0],[" + swapped + ",1,0]]"}}) {
+        // The child's keys as differences: 100, 101, then the swap entry.
+        const std::string toSwapped = std::to_string((RKSwappedPageKey | 9) - 101);
+        for (const auto& [regions, pages] : {std::pair{parentRegions, "[[1,100," + std::to_string((RKSwappedPageKey | 9) - 100) + "]]"},
+                                             std::pair{childRegions, "[[0,100,1," + toSwapped + "]]"}}) {
             Opened opened = open(snapshot("Linux", regions, withPages ? R"(,"sharedAnonymousPages":)" + pages : ""));
             EXPECT_TRUE(opened.process) << opened.error.localizedDescription.value_or("");
             if (!opened.process) return processes;
