@@ -139,8 +139,10 @@ TEST_F(RKVmsnapEndToEnd, BadFilesAndForbiddenProcessesEndInAMessageAndStatus1) {
 TEST_F(RKVmsnapEndToEnd, EveryProcessOfTheMachineSavedAndReported) {
     if (geteuid() != 0) GTEST_SKIP() << "-a needs root";
     const fs::path all = directory_ / "all";
-    RKCommandResult saved = RKRunCommand({VMSNAP_BINARY, "-a", "-o", all.string()});
-    ASSERT_TRUE(saved.exitedWith(0)) << saved.standardError;
+    // Saving takes as long as a live -a: on a busy build machine with hundreds of processes,
+    // minutes. It gets all of the test's time but what reading the files back needs.
+    RKCommandResult saved = RKRunCommand({VMSNAP_BINARY, "-a", "-o", all.string()}, std::chrono::seconds(270));
+    ASSERT_TRUE(saved.exitedWith(0)) << (saved.exitStatus ? "" : "killed at the timeout; ") << saved.standardError;
     std::vector<std::string> arguments = {MEMSPREAD_BINARY};
     for (const auto& entry : fs::directory_iterator(all)) arguments.push_back(entry.path().string());
     ASSERT_GT(arguments.size(), 2u);
