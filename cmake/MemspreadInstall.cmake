@@ -24,6 +24,8 @@ endforeach()
 add_custom_target(memspread_man ALL DEPENDS ${memspread_man_pages})
 install(FILES ${CMAKE_BINARY_DIR}/man/memspread.1.gz DESTINATION ${CMAKE_INSTALL_MANDIR}/man1)
 
+# bash-completion loads a command's script by the command's name: the one script, which completes
+# both commands, goes under both names (vmsnap's below).
 install(FILES ${CMAKE_SOURCE_DIR}/completion/memspread.bash
         DESTINATION ${CMAKE_INSTALL_DATADIR}/bash-completion/completions RENAME memspread)
 
@@ -37,6 +39,8 @@ function(memspread_install_vmsnap)
     if(EXISTS ${CMAKE_SOURCE_DIR}/man/vmsnap.1)
       install(FILES ${CMAKE_BINARY_DIR}/man/vmsnap.1.gz DESTINATION ${CMAKE_INSTALL_MANDIR}/man1)
     endif()
+    install(FILES ${CMAKE_SOURCE_DIR}/completion/memspread.bash
+            DESTINATION ${CMAKE_INSTALL_DATADIR}/bash-completion/completions RENAME vmsnap)
   endif()
 endfunction()
 cmake_language(DEFER DIRECTORY ${CMAKE_SOURCE_DIR} CALL memspread_install_vmsnap)
@@ -54,7 +58,8 @@ set(CPACK_DEBIAN_PACKAGE_DESCRIPTION
 of the system costs in physical memory, broken down by kind of memory
 (dirty, swapped, clean, reclaimable, wired). Memory that several processes
 share is counted once and shown under the exact set of processes that
-share it. It writes a text report and, on request, a JSON document.")
+share it. It writes a text report and, on request, a JSON document.
+vmsnap saves processes to snapshot files that memspread reports later.")
 set(CPACK_DEBIAN_PACKAGE_SECTION admin)
 set(CPACK_DEBIAN_PACKAGE_PRIORITY optional)
 set(CPACK_DEBIAN_FILE_NAME DEB-DEFAULT)

@@ -1,4 +1,4 @@
-# bash completion for memspread(1)                        -*- shell-script -*-
+# bash completion for memspread(1) and vmsnap(1)           -*- shell-script -*-
 
 # Names under which memspread finds running processes, one a line: the file name of the
 # executable, or, where the executable cannot be read (another user's process without root),
@@ -110,5 +110,32 @@ _memspread()
     _memspread_target "$cur"
 } &&
     complete -F _memspread memspread
+
+# vmsnap saves live processes: its targets are pids and names, never files.
+_vmsnap()
+{
+    local cur prev words cword split
+    _init_completion -s || return
+
+    case $prev in
+        -o | --output)
+            _filedir
+            return
+            ;;
+    esac
+    $split && return
+
+    if [[ $cur == -* ]]; then
+        COMPREPLY=($(compgen -W '-o --output -a --all -h --help' -- "$cur"))
+        return
+    fi
+    # The kernel (pid 0, "kernel") has no address space to save.
+    if [[ $cur == [0-9]* ]]; then
+        _memspread_add_matching "$cur" < <(_memspread_pids | grep -vx 0)
+    else
+        _memspread_add_matching "$cur" < <(_memspread_process_names | grep -vx kernel)
+    fi
+} &&
+    complete -F _vmsnap vmsnap
 
 # ex: filetype=sh

@@ -151,10 +151,12 @@ public:
                                     RKRegionWalkState& state);
     // After the walk: reads the noted regions' shared pages, or where frames are hidden the
     // bytes the kernel counts as shared in them.
-    void _gatherSharedAnonymousPages(RKRegionWalkState& state);
+    // A snapshot brings the pages it saved instead.
+    virtual void _gatherSharedAnonymousPages(RKRegionWalkState& state);
     // The shared pages, sorted by page; `range` indexes sharedAnonymousRegions(). Held from
     // gathering until the pass across processes has attributed them.
     std::vector<RKSharedAnonymousPage>& sharedAnonymousPages() { return sharedAnonymousPages_; }
+    const std::vector<RKSharedAnonymousPage>& sharedAnonymousPages() const { return sharedAnonymousPages_; }
     const std::vector<std::shared_ptr<RKMemoryRegion>>& sharedAnonymousRegions() const { return sharedAnonymousRegions_; }
     void releaseSharedAnonymousPages();
     // Anonymous bytes shared with other mappings that could not be attributed (frames hidden).

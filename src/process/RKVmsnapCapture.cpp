@@ -4,6 +4,7 @@
 #include "process/RKVmsnapCapture.h"
 
 #include <set>
+#include <unordered_map>
 
 #include "model/RKMemoryRegion.h"
 #include "model/RKRangeList.h"
@@ -55,6 +56,26 @@ RKVmsnapRegion regionRecord(const RKMemoryRegion& region) {
     return record;
 }
 
+// The process's shared anonymous pages, region by region. The query's list is sorted by key, so
+// each region's keys come out ascending.
+void captureSharedAnonymousPages(const RKUserProcess& process,
+                                 const std::unordered_map<const RKMemoryRegion*, uint32_t>& savedIndex,
+                                 RKVmsnapGraph& graph) {
+    const auto& regions = process.sharedAnonymousRegions();
+    std::vector<int64_t> listOfRange(regions.size(), -1);
+    for (const RKSharedAnonymousPage& page : process.sharedAnonymousPages()) {
+        if (page.range >= regions.size()) continue;
+        int64_t& list = listOfRange[page.range];
+        if (list < 0) {
+            auto found = savedIndex.find(regions[page.range].get());
+            if (found == savedIndex.end()) continue;
+            list = static_cast<int64_t>(graph.sharedAnonymousPages.size());
+            graph.sharedAnonymousPages.push_back({found->second, {}});
+        }
+        graph.sharedAnonymousPages[static_cast<size_t>(list)].keys.push_back(page.page);
+    }
+}
+
 }  // namespace
 
 RKVmsnapGraph RKVmsnapGraphForProcess(const RKUserProcess& process, const std::string& description) {
@@ -68,6 +89,7 @@ RKVmsnapGraph RKVmsnapGraphForProcess(const RKUserProcess& process, const std::s
     graph.physicalMemspreadPeak = process.phys_memspread_peak();
     graph.showsPhysMemspread = process.breakDownPhysMemspread();
     std::set<std::string> images;
+    std::unordered_map<const RKMemoryRegion*, uint32_t> savedIndex;
     for (const auto& region : process.memoryRegions().value_or(RKRegionList{})) {
         if (region->start == RKRegionNoAddress) {
             RKVmsnapUnaddressedRegion record;
@@ -81,8 +103,11 @@ RKVmsnapGraph RKVmsnapGraphForProcess(const RKUserProcess& process, const std::s
             continue;
         }
         if (isImageSegment(*region)) images.insert(region->detailedName);
+        savedIndex.emplace(region.get(), static_cast<uint32_t>(graph.regions.size()));
         graph.regions.push_back(regionRecord(*region));
     }
     for (const std::string& image : images) graph.binaryImagesDescription += image + "\n";
+    captureSharedAnonymousPages(process, savedIndex, graph);
+    graph.unattributedSharedAnonymousBytes = process.unattributedSharedAnonymousBytes();
     return graph;
 }

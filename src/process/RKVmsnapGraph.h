@@ -11,8 +11,9 @@
 
 #include "model/RKError.h"
 
-// The file version this program writes and the newest it reads.
-inline constexpr int64_t RKVmsnapVersion = 1;
+// The file version this program writes and the newest it reads. Version 2 added the shared
+// anonymous pages; version 1 files are still read (they have none).
+inline constexpr int64_t RKVmsnapVersion = 2;
 
 // One run of pages in one state, in the region's object-offset space.
 struct RKVmsnapSubrange {
@@ -75,6 +76,18 @@ struct RKVmsnapUnaddressedRegion {
     RKVmsnapRegionDetails details;
 };
 
+// The shared anonymous pages of one saved region, as the platform's shared-page query answered
+// them: their keys (a frame number, or a swap entry with RKSwappedPageKey set), ascending; a key
+// repeats where the region maps one page twice (KSM). `region` indexes the graph's regions.
+struct RKVmsnapSharedPages {
+    uint32_t region = 0;
+    std::vector<uint64_t> keys;
+};
+
+// A key bit no frame number or swap entry uses: a snapshot's pages carry it once read, so they
+// match the pages of other snapshots but never a live process's.
+inline constexpr uint64_t RKVmsnapPageKeyMark = 1ull << 62;
+
 struct RKVmsnapGraph {
     int64_t version = RKVmsnapVersion;
     bool is64bit = true;
@@ -88,6 +101,10 @@ struct RKVmsnapGraph {
     bool showsPhysMemspread = false;
     std::vector<RKVmsnapRegion> regions;  // ascending by address
     std::vector<RKVmsnapUnaddressedRegion> unaddressedRegions;
+    // The input of the pass that counts fork-shared anonymous pages once, so that snapshots
+    // analysed together share them as the live processes do.
+    std::vector<RKVmsnapSharedPages> sharedAnonymousPages;
+    uint64_t unattributedSharedAnonymousBytes = 0;  // frames were hidden: bytes shared, unattributed
 };
 
 inline constexpr const char* RKVmsnapErrorDomain = "MemspreadErrorDomain";

@@ -4,8 +4,10 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
+#include <unordered_map>
 
 #include "model/RKAssert.h"
 #include "model/RKMemoryRegion.h"
@@ -203,7 +205,39 @@ void RKVmsnapProcess::enumerateRegions(const RKRegionCallback& callback) {
 }
 
 void RKVmsnapProcess::_completeRegion(RKMemoryRegion& region) {
-    if (current_ && current_->details) applyDetails(region, *current_->details, pageSize());
+    if (!current_) return;
+    if (current_->details) applyDetails(region, *current_->details, pageSize());
+    builtRegions_.resize(graph_.regions.size(), nullptr);
+    builtRegions_[static_cast<size_t>(current_ - graph_.regions.data())] = &region;
+}
+
+void RKVmsnapProcess::_gatherSharedAnonymousPages(RKRegionWalkState& state) {
+    std::vector<const RKMemoryRegion*> built = std::move(builtRegions_);
+    builtRegions_.clear();
+    // Where the live walk would note no region, the snapshot brings no pages either.
+    if (state.hidden || state.sharingAnalysisDisabled) return;
+    unattributedSharedAnonymousBytes_ = graph_.unattributedSharedAnonymousBytes;
+    if (graph_.sharedAnonymousPages.empty()) return;
+    std::unordered_map<const RKMemoryRegion*, std::shared_ptr<RKMemoryRegion>> owner;
+    for (const auto& region : state.regions) owner.emplace(region.get(), region);
+    std::vector<int64_t> rangeOfSaved(graph_.regions.size(), -1);  // saved region -> range, or -1
+    sharedAnonymousPages_.clear();
+    sharedAnonymousRegions_.clear();
+    for (const RKVmsnapSharedPages& pages : graph_.sharedAnonymousPages) {
+        int64_t& range = rangeOfSaved[pages.region];
+        if (range < 0) {
+            auto found = owner.find(pages.region < built.size() ? built[pages.region] : nullptr);
+            if (found == owner.end()) continue;  // the walk made no region of it
+            range = static_cast<int64_t>(sharedAnonymousRegions_.size());
+            sharedAnonymousRegions_.push_back(found->second);
+        }
+        for (uint64_t key : pages.keys)
+            sharedAnonymousPages_.push_back(
+                {key | RKVmsnapPageKeyMark, static_cast<uint32_t>(range), (key & RKSwappedPageKey) ? 1u : 0u});
+    }
+    // The pass merges every process's pages in key order.
+    std::sort(sharedAnonymousPages_.begin(), sharedAnonymousPages_.end(),
+              [](const RKSharedAnonymousPage& a, const RKSharedAnonymousPage& b) { return a.page < b.page; });
 }
 
 void RKVmsnapProcess::_addUnconsumedOwnedObjectRegions(RKRegionWalkState& state) {

@@ -8,6 +8,7 @@
 #include <memory>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "model/RKError.h"
 #include "process/RKUserProcess.h"
@@ -39,6 +40,8 @@ public:
     bool _populateMemoryRegionWithPageQueries(RKMemoryRegion& region, const RKRegionSubmapInfo& info) override;
     void enumerateRegions(const RKRegionCallback& callback) override;
     void _completeRegion(RKMemoryRegion& region) override;
+    // The saved shared anonymous pages, on the regions built from their saved regions.
+    void _gatherSharedAnonymousPages(RKRegionWalkState& state) override;
     // The saved regions that have no address.
     void _addUnconsumedOwnedObjectRegions(RKRegionWalkState& state) override;
 
@@ -47,4 +50,6 @@ private:
 
     RKVmsnapGraph graph_;
     const RKVmsnapRegion* current_ = nullptr;  // the saved region the walk is handing over
+    // The region built from each saved region, for the walk's duration (not owned).
+    std::vector<const RKMemoryRegion*> builtRegions_;
 };

@@ -5,6 +5,7 @@
 
 #include <limits>
 
+#include "platform/RKKernelTypes.h"
 #include "process/RKVmsnapCompression.h"
 #include "process/RKVmsnapGraph.h"
 
@@ -15,6 +16,9 @@ using Json = nlohmann::json;
 // The largest text a snapshot may decompress to: far above any process seen (a few MB), low
 // enough that a forged size cannot exhaust memory.
 constexpr size_t kTextLimit = size_t{1} << 31;
+// The most shared anonymous pages a snapshot may list (64 GiB of 4 KiB pages): each becomes a
+// 16-byte record, so a forged count must not decide how much memory a read takes.
+constexpr uint64_t kSharedPageLimit = uint64_t{1} << 24;
 
 struct ParseFailure {
     std::string reason;
@@ -155,6 +159,38 @@ RKVmsnapUnaddressedRegion readUnaddressed(const Json& value, const std::string& 
     return region;
 }
 
+// Each region's shared pages: [region, key, difference to the next key, ...], keys ascending,
+// each a frame number or a swap entry, no more of them in a region than it has pages.
+void readSharedPages(const Json& lists, RKVmsnapGraph& graph) {
+    std::vector<uint64_t> pagesPerRegion(graph.regions.size(), 0);
+    uint64_t total = 0;
+    for (size_t i = 0; i < lists.size(); i++) {
+        const std::string where = "shared pages " + std::to_string(i) + " ";
+        const Json& value = lists[i];
+        if (!value.is_array() || value.size() < 2) fail(where, "is not an array of a region and its pages");
+        for (const Json& number : value)
+            if (!number.is_number_unsigned()) fail(where, "holds a value that is not an unsigned integer");
+        const uint64_t region = value[0].get<uint64_t>();
+        if (region >= graph.regions.size()) fail(where, "names a region the snapshot does not have");
+        const uint64_t count = value.size() - 1;
+        const uint64_t regionPages = graph.regions[region].length / graph.vmPageSize + 1;
+        if (count > regionPages || (pagesPerRegion[region] += count) > regionPages)
+            fail(where, "holds more pages than its region");
+        if ((total += count) > kSharedPageLimit) fail(where, "is past the most shared pages a snapshot may hold");
+        RKVmsnapSharedPages pages{static_cast<uint32_t>(region), {}};
+        pages.keys.reserve(count);
+        uint64_t key = 0;
+        for (size_t k = 1; k < value.size(); k++) {
+            const uint64_t difference = value[k].get<uint64_t>();
+            if (difference > std::numeric_limits<uint64_t>::max() - key) fail(where, "goes past the largest key");
+            key += difference;
+            if (key & RKVmsnapPageKeyMark) fail(where, "holds a key that is no frame number or swap entry");
+            pages.keys.push_back(key);
+        }
+        graph.sharedAnonymousPages.push_back(std::move(pages));
+    }
+}
+
 RKVmsnapGraph readGraph(const Json& document) {
     const std::string top;
     if (!document.is_object()) fail(top, "not a vmsnap (the document is not an object)");
@@ -194,6 +230,8 @@ RKVmsnapGraph readGraph(const Json& document) {
         for (size_t i = 0; i < regions->size(); i++)
             graph.unaddressedRegions.push_back(readUnaddressed((*regions)[i], "unaddressed region " + std::to_string(i) + " "));
     }
+    if (const Json* runs = arrayMember(document, "sharedAnonymousPages", top)) readSharedPages(*runs, graph);
+    graph.unattributedSharedAnonymousBytes = unsignedMember(document, "unattributedSharedAnonymousBytes", top);
     return graph;
 }
 

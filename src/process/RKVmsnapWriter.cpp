@@ -2,6 +2,8 @@
 // keeps files small and lets hand-made snapshots state only what matters.
 #include <nlohmann/json.hpp>
 
+#include <utility>
+
 #include "process/RKVmsnapCompression.h"
 #include "process/RKVmsnapGraph.h"
 
@@ -89,6 +91,19 @@ std::string RKVmsnapSerialize(const RKVmsnapGraph& graph) {
         unaddressed.push_back(std::move(object));
     }
     document["unaddressedRegions"] = std::move(unaddressed);
+    if (!graph.sharedAnonymousPages.empty()) {
+        Json runs = Json::array();
+        // Keys as differences from the one before: frames of one region lie near each other,
+        // and small numbers are what keeps the list small.
+        for (const RKVmsnapSharedPages& pages : graph.sharedAnonymousPages) {
+            Json list = Json::array({pages.region});
+            uint64_t previous = 0;
+            for (uint64_t key : pages.keys) list.push_back(key - std::exchange(previous, key));
+            runs.push_back(std::move(list));
+        }
+        document["sharedAnonymousPages"] = std::move(runs);
+    }
+    put(document, "unattributedSharedAnonymousBytes", graph.unattributedSharedAnonymousBytes);
     // Names and paths come from other processes and need not be UTF-8: replace what is not.
     return RKVmsnapCompress(document.dump(-1, ' ', false, Json::error_handler_t::replace) + "\n");
 }

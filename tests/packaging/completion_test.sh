@@ -1,11 +1,12 @@
 #!/usr/bin/env bash
-# The bash completion offers what memspread accepts: the --sort columns and -f formats that the
-# binary itself lists, every option of its usage, running processes by name (also one with a
-# space in its name) and by pid, and files where a file is expected.
-# Usage: completion_test.sh MEMSPREAD_BINARY COMPLETION_SCRIPT
+# The bash completion offers what memspread and vmsnap accept: the --sort columns and -f formats
+# that the binary itself lists, every option of each usage, running processes by name (also one
+# with a space in its name) and by pid, and files where a file is expected.
+# Usage: completion_test.sh MEMSPREAD_BINARY COMPLETION_SCRIPT VMSNAP_BINARY
 set -uo pipefail
 binary=$1
 script=$2
+vmsnap=$3
 failures=0
 
 source /usr/share/bash-completion/bash_completion || exit 1
@@ -27,7 +28,7 @@ complete_line() {
     while IFS= read -r -d ' ' word; do COMP_WORDS+=("${word//$'\x01'/\\ }"); done <<<"${line//\\ /$'\x01'} "
     COMP_CWORD=$((${#COMP_WORDS[@]} - 1))
     COMPREPLY=()
-    _memspread
+    "_${COMP_WORDS[0]}"
     printf '%s\n' "${COMPREPLY[@]}" | sort
 }
 
@@ -50,9 +51,14 @@ expect_same "--sort=" "$columns" "$(complete_line 'memspread --sort=')"
 expect_same "-f" "$formats" "$(complete_line 'memspread -f ')"
 expect_same "--sort re" "$(grep '^re' <<<"$columns")" "$(complete_line 'memspread --sort re')"
 
-# Every option of the usage text.
+# Every option of the usage texts.
 for option in $("$binary" -h | grep -oE -- '(^|[ ,])--?[A-Za-z]+' | tr -d ' ,' | sort -u); do
     expect_offered 'memspread -' "$option"
+done
+vmsnap_options=$("$vmsnap" -h | grep -oE -- '(^|[ ,])--?[A-Za-z]+' | tr -d ' ,' | sort -u)
+[[ $(wc -l <<<"$vmsnap_options") -ge 6 ]] || fail "cannot read the options of $vmsnap"
+for option in $vmsnap_options; do
+    expect_offered 'vmsnap -' "$option"
 done
 
 # A running process by name, quoted for the shell, and by pid, as a target and after -x; a
@@ -76,11 +82,18 @@ if [[ $(cat /proc/2/comm 2>/dev/null) == kthreadd ]]; then
     complete_line 'memspread kthread' | grep -q . && fail "the kernel thread kthreadd is offered"
 fi
 [[ -z $(complete_line 'memspread --pid memspread') ]] || fail "--pid offered names"
+# vmsnap saves the same processes, but not the kernel.
+expect_offered 'vmsnap memspread\ compl' "$quoted"
+expect_offered "vmsnap $pid" "$pid"
+complete_line 'vmsnap 0' | grep -qx 0 && fail "vmsnap offers the kernel's pid"
+complete_line 'vmsnap kern' | grep -qx kernel && fail "vmsnap offers the kernel"
 
 # Files for -j and for a target that looks like a path.
 touch "$work/report.json"
 expect_offered "memspread -j $work/rep" "$work/report.json"
 expect_offered "memspread --metrilog=$work/rep" "$work/report.json"
 expect_offered "memspread $work/rep" "$work/report.json"
+expect_offered "vmsnap -o $work/rep" "$work/report.json"
+[[ -z $(complete_line "vmsnap $work/rep") ]] || fail "vmsnap offered a file as a target"
 
 exit $((failures > 0))

@@ -4,10 +4,12 @@
 # the usage text is one of the parser's, which leaves out only the options it hides on purpose;
 # the man page names every --sort column and -f format that the binary accepts, and says "not
 # yet" only of what the binary does not do yet; and groff reads every page without a warning.
-# Usage: docs_test.sh MEMSPREAD_BINARY SOURCE_DIR
+# vmsnap's page names every option of vmsnap's usage.
+# Usage: docs_test.sh MEMSPREAD_BINARY SOURCE_DIR VMSNAP_BINARY
 set -uo pipefail
 binary=$1
 source_dir=$2
+vmsnap=$3
 failures=0
 
 fail() {
@@ -60,6 +62,13 @@ formats=$("$binary" -f nonsense 2>&1 >/dev/null | sed -n 's/^Accepted arguments:
 for value in $columns $formats; do
     mentions "$man_text" "$value" || fail "the value $value is not in man/memspread.1"
     mentions "$usage_doc" "$value" || fail "the value $value is not in docs/usage.md"
+done
+
+vmsnap_text=$(sed -E 's/\\-/-/g; s/\\f[BIRP]//g' "$source_dir/man/vmsnap.1")
+vmsnap_options=$("$vmsnap" -h | grep -oE -- '(^|[ ,])--?[A-Za-z]+' | tr -d ' ,' | sort -u)
+[[ $(wc -l <<<"$vmsnap_options") -ge 6 ]] || fail "cannot read the options of $vmsnap"
+for option in $vmsnap_options; do
+    mentions "$vmsnap_text" "$option" || fail "$option is not in man/vmsnap.1"
 done
 
 # The page's sentences on what this version does not do yet must still be true, so that the page

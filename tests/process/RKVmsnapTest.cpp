@@ -1,8 +1,10 @@
 // Snapshots: the file format in both directions (and every kind of damage ending in an error),
 // and the snapshot process built from hand-made files: platform, translation, images from typed
-// regions, figures from the file and the details a Linux snapshot carries.
+// regions, figures from the file, the details a Linux snapshot carries and the shared anonymous
+// pages it hands to the pass across processes.
 #include <gtest/gtest.h>
 
+#include "analysis/RKSharedAnonymousPass.h"
 #include "model/RKMemoryRegion.h"
 #include "model/RKRangeList.h"
 #include "platform/RKScriptedPlatform.h"
@@ -55,6 +57,8 @@ TEST_F(RKVmsnapTest, GraphSurvivesTheFileCompressedAndEveryDamageIsAnError) {
     region.details = RKVmsnapRegionDetails{"heap", "", 0x2000, 0, 0x1000, 0, true, false, {{0, 0x2000, 0x2000, 0, 0, 0, 0x2000}}};
     graph.regions = {region};
     graph.unaddressedRegions = {{0x5000, 0, 0xFFFFFFFFFFFFFFFFull, 2, 0, {"page table", "", 0x5000, 0, 0, 0, false, false, {}}}};
+    graph.sharedAnonymousPages = {{0, {100, 101, 101, RKSwappedPageKey | 7}}};
+    graph.unattributedSharedAnonymousBytes = 0x3000;
     const std::string bytes = RKVmsnapSerialize(graph);
     ASSERT_TRUE(RKVmsnapIsCompressed(bytes));
     RKError error;
@@ -64,6 +68,9 @@ TEST_F(RKVmsnapTest, GraphSurvivesTheFileCompressedAndEveryDamageIsAnError) {
     EXPECT_EQ(back->regions[0].object_id, region.object_id);
     EXPECT_EQ(back->regions[0].details->subranges[0].wired, 0x2000u);
     EXPECT_EQ(back->unaddressedRegions[0].details.name, "page table");
+    ASSERT_EQ(back->sharedAnonymousPages.size(), 1u);
+    EXPECT_EQ(back->sharedAnonymousPages[0].keys, graph.sharedAnonymousPages[0].keys);
+    EXPECT_EQ(back->unattributedSharedAnonymousBytes, 0x3000u);
 
     const std::string plain = snapshot("Linux");
     const std::pair<std::string, std::string> damaged[] = {
@@ -74,14 +81,31 @@ TEST_F(RKVmsnapTest, GraphSurvivesTheFileCompressedAndEveryDamageIsAnError) {
         {bytes + bytes, "data after the end"},
         {"[1,2]", "not a vmsnap"},
         {R"({"format":"other"})", "not a memspread vmsnap"},
-        {snapshot("Linux", "[]", R"(,"version":2)").replace(0, 1, "{\"version\":2,"), "unsupported version 2"},
+        {snapshot("Linux", "[]", R"(,"version":3)").replace(0, 1, "{\"version\":3,"), "unsupported version 3"},
         {snapshot("Linux", R"([{"address":4096,"length":"big"}])"), "region 0 \"length\" is not an unsigned integer"},
         {snapshot("Linux", R"([{"address":8192,"length":4096},{"address":4096,"length":4096}])"), "region 1 overlaps"},
         {snapshot("Linux", R"([{"address":18446744073709547520,"length":8192}])"), "wraps around"},
         {snapshot("Linux", R"([{"address":4096,"length":4096,"details":{"subranges":[[1,2]]}}])"), "subrange 0 is not an array of 7"},
         {snapshot("Linux").replace(snapshot("Linux").find("4096"), 4, "3000"), "\"vmPageSize\" is not a page size"},
     };
-    for (const auto& [input, reason] : damaged) {
+    // Shared pages: [region, key, difference, ...] over one region of 4 pages.
+    const auto runs = [](const std::string& list) {
+        return snapshot("Linux", R"([{"address":4096,"length":16384}])", R"(,"sharedAnonymousPages":)" + list);
+    };
+    const std::pair<std::string, std::string> badRuns[] = {
+        {runs("[[0]]"), "shared pages 0 is not an array of a region and its pages"},
+        {runs("[[0,5,-1]]"), "not an unsigned integer"},
+        {runs("[[1,5]]"), "names a region the snapshot does not have"},
+        {runs("[[0,4611686018427387904]]"), "holds a key that is no frame number"},
+        {runs("[[0,9223372036854775807,9223372036854775807]]"), "holds a key that is no frame number"},
+        {runs("[[0,9223372036854775808,9223372036854775808]]"), "goes past the largest key"},
+        {runs("[[0,1,1,1,1,1,1]]"), "holds more pages than its region"},
+        {runs("[[0,1,1,1],[0,9,1,1]]"), "shared pages 1 holds more pages than its region"},
+        {runs("{}"), "\"sharedAnonymousPages\" is not an array"},
+    };
+    for (const auto& cases : {std::vector(std::begin(damaged), std::end(damaged)),
+                              std::vector(std::begin(badRuns), std::end(badRuns))})
+    for (const auto& [input, reason] : cases) {
         RKError failure;
         EXPECT_FALSE(RKVmsnapParse(input, &failure)) << reason;
         EXPECT_EQ(failure.domain, "MemspreadErrorDomain");
@@ -173,4 +197,52 @@ TEST_F(RKVmsnapTest, LinuxDetailsRestoreTheRegionsTheLiveRunBuilt) {
     EXPECT_EQ(list[1]->name, "page table");
     EXPECT_EQ(list[1]->dirtySize, 8192u);
     EXPECT_EQ(list[1]->object_id, 0xFFFFFFFFFFFFFFFFull);
+}
+
+TEST_F(RKVmsnapTest, SavedSharedPagesMeetAcrossSnapshotsAsLiveFramesDo) {
+    // A forked pair saved together: two pages of each one's heap are the same frames (one of
+    // them swapped), a third page the child holds alone, and the parent's heap is the second
+    // region. Version 1 files have no pages and so share nothing.
+    const std::string heap = R"("user_tag":2,"share_mode":1,"resident_size":12288,"dirty_size":12288,
+        "details":{"name":"heap","dirty":12288,"swapped":4096})";
+    const std::string parentRegions = R"([{"address":4096,"length":4096,"details":{"name":"stack"}},
+        {"address":65536,"length":16384,)" + heap + "}]";
+    const std::string childRegions = R"([{"address":65536,"length":16384,)" + heap + "}]";
+    auto pair = [&](bool withPages) {
+        std::vector<std::shared_ptr<RKProcess>> processes;
+        // The child's keys as differences: 100, 101, then the swap entry.
+        const std::string toSwapped = std::to_string((RKSwappedPageKey | 9) - 101);
+        for (const auto& [regions, pages] : {std::pair{parentRegions, "[[1,100," + std::to_string((RKSwappedPageKey | 9) - 100) + "]]"},
+                                             std::pair{childRegions, "[[0,100,1," + toSwapped + "]]"}}) {
+            Opened opened = open(snapshot("Linux", regions, withPages ? R"(,"sharedAnonymousPages":)" + pages : ""));
+            EXPECT_TRUE(opened.process) << opened.error.localizedDescription.value_or("");
+            if (!opened.process) return processes;
+            opened.process->gatherData();
+            processes.push_back(opened.process);
+        }
+        return processes;
+    };
+    auto processes = pair(true);
+    ASSERT_EQ(processes.size(), 2u);
+    auto& parent = dynamic_cast<RKVmsnapProcess&>(*processes[0]);
+    ASSERT_EQ(parent.sharedAnonymousPages().size(), 2u);
+    EXPECT_EQ(parent.sharedAnonymousPages()[0].page, 100 | RKVmsnapPageKeyMark) << "never a live process's frame";
+    EXPECT_EQ(parent.sharedAnonymousPages()[1].swapped, 1u);
+    EXPECT_EQ(parent.sharedAnonymousRegions()[0]->name, "heap");
+
+    RKSharedAnonymousSummary summary = RKAttributeSharedAnonymousPages(processes);
+    EXPECT_EQ(summary.sharedPages, 2u);
+    for (const auto& process : processes) {
+        SCOPED_TRACE(process->displayString());
+        const auto& regions = *process->memoryRegions();
+        const RKMemoryRegion& heapRegion = *regions[regions.size() - 2];
+        EXPECT_EQ(heapRegion.dirtySize, 8192u) << "the shared frame left it; the child's own stayed";
+        EXPECT_EQ(heapRegion.swappedSize, 0u);
+        const RKMemoryRegion& shared = *regions.back();
+        EXPECT_EQ(shared.start, RKRegionNoAddress);
+        EXPECT_EQ(shared.name, "heap");
+        EXPECT_EQ(shared.dirtySize, 4096u);
+        EXPECT_EQ(shared.swappedSize, 4096u);
+    }
+    EXPECT_EQ(RKAttributeSharedAnonymousPages(pair(false)).sharedPages, 0u);
 }
