@@ -15,6 +15,7 @@
 #include "process/RKAnalysisSettings.h"
 #include "process/RKUserProcess.h"
 #include "support/RKFixtureProcess.h"
+#include "support/RKReportRows.h"
 #include "support/RKRunCommand.h"
 
 namespace {
@@ -28,19 +29,6 @@ const RKMemoryRegion& regionAt(const RKProcess& process, const RKFixtureProcess&
     for (const auto& region : process.memoryRegions().value_or(RKRegionList{}))
         if (region->start <= address && address < region->end()) return *region;
     return none;
-}
-
-// The Dirty column by category of the table that follows the first `heading` at or after `from`
-// in a report in bytes.
-std::map<std::string, uint64_t> dirtyByCategory(const std::string& report, const std::string& heading,
-                                                size_t from = 0) {
-    static const std::regex row(R"(^ *(\d+) B +\d+ B +\d+ B +\d+    (.+)$)");
-    std::map<std::string, uint64_t> rows;
-    for (const std::string& line : RKSplitLines(report.substr(std::min(report.find(heading, from), report.size())))) {
-        std::smatch match;
-        if (!rows.count("TOTAL") && std::regex_match(line, match, row)) rows[match[2]] = std::stoull(match[1]);
-    }
-    return rows;
 }
 
 // Prints "PID MEMSPREAD" per process object in pid order, then "shared PID PID..." per shared
@@ -118,12 +106,12 @@ TEST(RKUserProcessFixture, ReportShowsSharedMemoryOnceTheDocumentAgreesAndAllPro
     const std::string& report = run.standardOutput;
     const std::map<std::string, uint64_t> sharedKinds = {
         {"memfd", 32 * P}, {"shared anonymous", 16 * P}, {"SysV shared memory", 16 * P}};
-    auto summary = dirtyByCategory(report, "Summary Memspread: ");
-    uint64_t once = dirtyByCategory(report, "Shared with ")["TOTAL"];  // each process's own, plus this once
+    auto summary = RKDirtyByCategory(report, "Summary Memspread: ");
+    uint64_t once = RKDirtyByCategory(report, "Shared with ")["TOTAL"];  // each process's own, plus this once
     for (const std::string& header : {"[" + parent + "]: 64-bit", "[" + child + "]: 64-bit"}) {
         SCOPED_TRACE(header);
-        auto own = dirtyByCategory(report, header);
-        auto shared = dirtyByCategory(report, "Shared with ", report.find(header));
+        auto own = RKDirtyByCategory(report, header);
+        auto shared = RKDirtyByCategory(report, "Shared with ", report.find(header));
         for (const auto& [kind, bytes] : sharedKinds) {
             EXPECT_EQ(shared[kind], bytes) << kind;
             EXPECT_EQ(own.count(kind), 0u) << kind << " is not the process's alone";
