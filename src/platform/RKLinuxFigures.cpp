@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cerrno>
 
+#include "platform/RKLinuxFrameVerdicts.h"
 #include "platform/RKLinuxOwnedObjects.h"
 #include "platform/RKLinuxPlatform.h"
 #include "platform/RKLinuxTask.h"
@@ -57,9 +58,15 @@ int RKLinuxPlatform::sysVSegments(std::vector<RKSysVSegment>& segments) {
     return error;
 }
 
-void RKLinuxPlatform::beginGather() { sysV_->begin(); }
+void RKLinuxPlatform::beginGather() {
+    sysV_->begin();
+    frameVerdicts_->begin();
+}
 
-void RKLinuxPlatform::endGather() { sysV_->end(); }
+void RKLinuxPlatform::endGather() {
+    sysV_->end();
+    frameVerdicts_->end();
+}
 
 int RKLinuxPlatform::ownedVmObjects(RKTask& task, std::vector<RKOwnedVmObjectRecord>& records) {
     auto* target = dynamic_cast<RKLinuxTask*>(&task);

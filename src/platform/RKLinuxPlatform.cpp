@@ -11,6 +11,7 @@
 #include <chrono>
 
 #include "platform/RKDescriptorBudget.h"
+#include "platform/RKLinuxFrameVerdicts.h"
 #include "platform/RKLinuxOwnedObjects.h"
 #include "platform/RKLinuxTask.h"
 
@@ -44,7 +45,8 @@ void raiseDescriptorLimit() {
 RKLinuxPlatform::RKLinuxPlatform(std::string procRoot, std::string sysRoot)
     : procRoot_(std::move(procRoot)),
       sysRoot_(std::move(sysRoot)),
-      sysV_(std::make_shared<RKSysVTableOfGather>(procRoot_)) {
+      sysV_(std::make_shared<RKSysVTableOfGather>(procRoot_)),
+      frameVerdicts_(std::make_shared<RKFrameVerdictsOfGather>()) {
     static const bool raised = (raiseDescriptorLimit(), true);
     (void)raised;
 }

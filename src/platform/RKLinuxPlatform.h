@@ -7,6 +7,7 @@
 
 #include "platform/RKPlatform.h"
 
+class RKFrameVerdictsOfGather;
 class RKSysVTableOfGather;
 
 class RKLinuxPlatform : public RKPlatform {
@@ -75,4 +76,5 @@ private:
     std::string procRoot_;
     std::string sysRoot_;
     std::shared_ptr<RKSysVTableOfGather> sysV_;  // read once a gather (RKLinuxOwnedObjects.cpp)
+    std::shared_ptr<RKFrameVerdictsOfGather> frameVerdicts_;  // read once a gather
 };

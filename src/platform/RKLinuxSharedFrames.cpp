@@ -1,14 +1,16 @@
 // The anonymous pages a process shares with other mappings (after fork, or merged by KSM),
 // identified by frame number, or by swap entry when swapped: pagemap read in chunks (where
-// PAGEMAP_SCAN found pages, when the kernel has it), then
-// /proc/kpagecount and /proc/kpageflags over runs of consecutive frames. Exclusivity comes
-// from kpagecount, not pagemap's bit 56, which is wrong for PMD-mapped huge pages.
+// PAGEMAP_SCAN found pages, when the kernel has it), then whether each frame is mapped more
+// than once from /proc/kpagecount and /proc/kpageflags, once a frame in a gather
+// (RKLinuxFrameVerdicts.h). Exclusivity comes from kpagecount, not pagemap's bit 56, which is
+// wrong for PMD-mapped huge pages.
 #include <fcntl.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
 
+#include "platform/RKLinuxFrameVerdicts.h"
 #include "platform/RKLinuxPageReader.h"
 #include "platform/RKLinuxPlatform.h"
 #include "platform/RKLinuxTask.h"
@@ -16,8 +18,6 @@
 #include "platform/RKUniqueFd.h"
 
 namespace {
-
-constexpr uint64_t kFramesPerRead = 4096;
 
 // Every present page (by frame) and swapped page (by swap entry) of the ranges. Where the
 // kernel has PAGEMAP_SCAN, pagemap is read only where it found pages.
@@ -55,34 +55,19 @@ kern_return_t readCandidates(int pagemap, uint64_t pageSize, bool scan, const st
 }
 
 // Keeps the present pages that more than one mapping holds and that are no zero page, and
-// every swapped page (only the pass across processes can tell who else holds those).
-void keepShared(int kpagecount, int kpageflags, std::vector<RKSharedAnonymousPage>& pages) {
-    std::vector<uint64_t> counts, flags;
+// every swapped page (only the pass across processes can tell who else holds those). `pages`
+// is sorted: the swapped ones, keyed above every frame, come last.
+void keepShared(RKFrameVerdicts& verdicts, int kpagecount, int kpageflags, std::vector<RKSharedAnonymousPage>& pages) {
+    const size_t present = static_cast<size_t>(
+        std::partition_point(pages.begin(), pages.end(), [](const auto& p) { return !(p.page & RKSwappedPageKey); }) -
+        pages.begin());
+    std::vector<uint64_t> frames(present);
+    for (size_t i = 0; i < present; i++) frames[i] = pages[i].page;
+    std::vector<uint8_t> shared(present);
+    verdicts.shared(kpagecount, kpageflags, frames, shared);
     size_t kept = 0;
-    size_t i = 0;
-    while (i < pages.size()) {
-        if (pages[i].page & RKSwappedPageKey) {
-            pages[kept++] = pages[i++];
-            continue;
-        }
-        // One run of frames: from this page's frame up to kFramesPerRead frames on, as far as
-        // the sorted pages stay dense enough to be worth one read.
-        const uint64_t first = pages[i].page;
-        size_t j = i;
-        uint64_t last = first;
-        while (j < pages.size() && !(pages[j].page & RKSwappedPageKey) && pages[j].page < first + kFramesPerRead &&
-               pages[j].page <= last + 64)
-            last = pages[j++].page;
-        const uint64_t length = last - first + 1;
-        counts.resize(length);
-        flags.resize(length);
-        const bool read = RKPreadAll(kpagecount, counts.data(), length * 8, first * 8) &&
-                          RKPreadAll(kpageflags, flags.data(), length * 8, first * 8);
-        for (; i < j; i++) {
-            const uint64_t at = pages[i].page - first;
-            if (read && counts[at] > 1 && !(flags[at] & RKKpfZeroPage)) pages[kept++] = pages[i];
-        }
-    }
+    for (size_t i = 0; i < pages.size(); i++)
+        if (i >= present || shared[i]) pages[kept++] = pages[i];
     pages.resize(kept);
 }
 
@@ -109,7 +94,7 @@ kern_return_t RKLinuxPlatform::sharedAnonymousPages(RKTask& task, const std::vec
     RKUniqueFd kpagecount(::open((procRoot() + "/kpagecount").c_str(), O_RDONLY | O_CLOEXEC));
     RKUniqueFd kpageflags(::open((procRoot() + "/kpageflags").c_str(), O_RDONLY | O_CLOEXEC));
     if (!kpagecount.valid() || !kpageflags.valid()) return KERN_NOT_SUPPORTED;
-    keepShared(kpagecount.get(), kpageflags.get(), pages);
+    keepShared(*frameVerdicts_->verdicts(), kpagecount.get(), kpageflags.get(), pages);
     pages.shrink_to_fit();
     return KERN_SUCCESS;
 }
