@@ -48,6 +48,7 @@ void RKUserProcess::_gatherSharedAnonymousPages(RKRegionWalkState& state) {
 }
 
 void RKUserProcess::releaseSharedAnonymousPages() {
-    sharedAnonymousPages_ = {};
-    sharedAnonymousRegions_ = {};
+    // Swapped with empty vectors: assigning {} would keep their capacity, the records' memory.
+    std::vector<RKSharedAnonymousPage>().swap(sharedAnonymousPages_);
+    RKRegionList().swap(sharedAnonymousRegions_);
 }

@@ -88,7 +88,7 @@ TEST_F(RKSharedAnonymousPassTest, EachPageInTheGroupOfExactlyItsHolders) {
     for (pid_t pid : {10, 11, 12}) EXPECT_EQ(memspread.pidToMemspread().at(pid), 8 * P) << pid;
     // Nothing per page is kept after the pass.
     for (const auto& process : memspread.processes())
-        EXPECT_TRUE(std::dynamic_pointer_cast<RKUserProcess>(process)->sharedAnonymousPages().empty());
+        EXPECT_TRUE(std::dynamic_pointer_cast<RKUserProcess>(process)->sharedAnonymousPages().capacity() == 0u);
 }
 
 TEST_F(RKSharedAnonymousPassTest, HiddenFramesLeaveTheNumbersAndWarnOnce) {
