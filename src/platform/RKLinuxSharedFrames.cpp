@@ -19,40 +19,89 @@
 
 namespace {
 
-// Every present page (by frame) and swapped page (by swap entry) of the ranges. Where the
-// kernel has PAGEMAP_SCAN, pagemap is read only where it found pages.
-kern_return_t readCandidates(int pagemap, uint64_t pageSize, bool scan, const std::vector<RKPageQueryRange>& ranges,
-                             std::vector<RKSharedAnonymousPage>& pages) {
-    std::vector<RKPageScanRun> runs;
-    for (uint32_t r = 0; r < ranges.size(); r++) {
-        const bool fileBacked = ranges[r].fileBacked;
-        auto take = [&](uint64_t, std::span<const uint64_t> entries) {
-            for (uint64_t entry : entries) {
-                if (fileBacked && (entry & RKPagemapFilePage)) continue;  // page cache, not a copy
-                if ((entry & RKPagemapPresent) && (entry & RKPagemapFrameMask) != 0)
-                    pages.push_back({entry & RKPagemapFrameMask, r, 0});
-                else if (!(entry & RKPagemapPresent) && (entry & RKPagemapSwapped))
-                    pages.push_back({RKSwappedPageKey | (entry & RKPagemapFrameMask), r, 1});
+// Ranges up to this many pages are read from pagemap directly: a scan first costs a second
+// system call for pages that are nearly all there.
+constexpr uint64_t kDirectPages = 512;
+// Small ranges this close together (mappings a guard page apart) share one read, up to a read's
+// worth of entries.
+constexpr uint64_t kJoinGapPages = 16;
+constexpr uint64_t kWindowPages = 4096;
+
+class CandidateReader {
+public:
+    CandidateReader(int pagemap, uint64_t pageSize, const std::vector<RKPageQueryRange>& ranges,
+                    std::vector<RKSharedAnonymousPage>& pages)
+        : pagemap_(pagemap), pageSize_(pageSize), ranges_(ranges), pages_(pages) {}
+
+    // Every present page (by frame) and swapped page (by swap entry) of the ranges. Where the
+    // kernel has PAGEMAP_SCAN, a large range's pagemap is read only where it found pages.
+    kern_return_t read(bool scan) {
+        for (uint32_t r = 0; r < ranges_.size();) {
+            if (scan && pages(r) > kDirectPages) {
+                kern_return_t result = scanRange(r++);
+                if (result != KERN_SUCCESS) return result;
+                continue;
             }
-        };
-        const uint64_t first = ranges[r].start / pageSize;
-        const uint64_t end = (ranges[r].start + ranges[r].size + pageSize - 1) / pageSize;
-        if (!scan) {
-            if (!RKReadPagemap(pagemap, first, end - first, take)) return KERN_INVALID_ARGUMENT;
-            continue;
+            uint32_t last = r + 1;
+            while (last < ranges_.size() && (!scan || pages(last) <= kDirectPages) && first(last) >= end(last - 1) &&
+                   first(last) - end(last - 1) <= kJoinGapPages && end(last) - first(r) <= kWindowPages)
+                last++;
+            if (!readWindow(r, last)) return KERN_INVALID_ARGUMENT;
+            r = last;
         }
-        kern_return_t result = RKScanPresentPages(pagemap, first * pageSize, end * pageSize, runs);
-        if (result != KERN_SUCCESS) return result;
-        for (size_t i = 0; i < runs.size();) {
-            // Adjacent runs (pages of other categories) in one read.
-            const uint64_t start = runs[i].start;
-            uint64_t stop = runs[i].end;
-            for (i++; i < runs.size() && runs[i].start == stop; i++) stop = runs[i].end;
-            if (!RKReadPagemap(pagemap, start / pageSize, (stop - start) / pageSize, take)) return KERN_INVALID_ARGUMENT;
+        return KERN_SUCCESS;
+    }
+
+private:
+    uint64_t first(uint32_t r) const { return ranges_[r].start / pageSize_; }
+    uint64_t end(uint32_t r) const { return (ranges_[r].start + ranges_[r].size + pageSize_ - 1) / pageSize_; }
+    uint64_t pages(uint32_t r) const { return end(r) - first(r); }
+
+    void take(uint32_t r, std::span<const uint64_t> entries) {
+        const bool fileBacked = ranges_[r].fileBacked;
+        for (uint64_t entry : entries) {
+            if (fileBacked && (entry & RKPagemapFilePage)) continue;  // page cache, not a copy
+            if ((entry & RKPagemapPresent) && (entry & RKPagemapFrameMask) != 0)
+                pages_.push_back({entry & RKPagemapFrameMask, r, 0});
+            else if (!(entry & RKPagemapPresent) && (entry & RKPagemapSwapped))
+                pages_.push_back({RKSwappedPageKey | (entry & RKPagemapFrameMask), r, 1});
         }
     }
-    return KERN_SUCCESS;
-}
+
+    // Ranges [r, last): one read from the first's start to the last's end (or chunked reads of a
+    // large range on a kernel without PAGEMAP_SCAN), the holes between them read and dropped.
+    bool readWindow(uint32_t r, uint32_t last) {
+        const uint64_t from = first(r);
+        return RKReadPagemap(pagemap_, from, end(last - 1) - from, [&](uint64_t page, std::span<const uint64_t> entries) {
+            const uint64_t to = page + entries.size();
+            for (uint32_t i = r; i < last; i++) {
+                const uint64_t a = std::max(first(i), page), b = std::min(end(i), to);
+                if (a < b) take(i, entries.subspan(a - page, b - a));
+            }
+        });
+    }
+
+    kern_return_t scanRange(uint32_t r) {
+        kern_return_t result = RKScanPresentPages(pagemap_, first(r) * pageSize_, end(r) * pageSize_, runs_);
+        if (result != KERN_SUCCESS) return result;
+        for (size_t i = 0; i < runs_.size();) {
+            // Adjacent runs (pages of other categories) in one read.
+            const uint64_t start = runs_[i].start;
+            uint64_t stop = runs_[i].end;
+            for (i++; i < runs_.size() && runs_[i].start == stop; i++) stop = runs_[i].end;
+            if (!RKReadPagemap(pagemap_, start / pageSize_, (stop - start) / pageSize_,
+                               [&](uint64_t, std::span<const uint64_t> entries) { take(r, entries); }))
+                return KERN_INVALID_ARGUMENT;
+        }
+        return KERN_SUCCESS;
+    }
+
+    int pagemap_;
+    uint64_t pageSize_;
+    const std::vector<RKPageQueryRange>& ranges_;
+    std::vector<RKSharedAnonymousPage>& pages_;
+    std::vector<RKPageScanRun> runs_;
+};
 
 // Keeps the present pages that more than one mapping holds and that are no zero page, and
 // every swapped page (only the pass across processes can tell who else holds those). `pages`
@@ -87,8 +136,8 @@ kern_return_t RKLinuxPlatform::sharedAnonymousPages(RKTask& task, const std::vec
     }
     RKUniqueFd pagemap(::openat(target->directoryFd(), "pagemap", O_RDONLY | O_CLOEXEC));
     if (!pagemap.valid()) return errno == EACCES || errno == EPERM ? KERN_PROTECTION_FAILURE : KERN_INVALID_ARGUMENT;
-    kern_return_t result =
-        readCandidates(pagemap.get(), kernelPageSize(), RKProbePageReading(procRoot()).pagemapScan, ranges, pages);
+    kern_return_t result = CandidateReader(pagemap.get(), kernelPageSize(), ranges, pages)
+                               .read(RKProbePageReading(procRoot()).pagemapScan);
     if (result != KERN_SUCCESS) return result;
     std::sort(pages.begin(), pages.end(), [](const auto& a, const auto& b) { return a.page < b.page; });
     RKUniqueFd kpagecount(::open((procRoot() + "/kpagecount").c_str(), O_RDONLY | O_CLOEXEC));
