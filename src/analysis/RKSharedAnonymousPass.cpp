@@ -4,25 +4,17 @@
 
 #include <algorithm>
 #include <cstdint>
-#include <queue>
 #include <string>
 #include <unordered_map>
 #include <vector>
 
 #include "analysis/RKMemspread.h"
+#include "analysis/RKPageKeyRanks.h"
 #include "model/RKMemoryRegion.h"
 #include "model/RKMemoryTotal.h"
 #include "process/RKUserProcess.h"
 
 namespace {
-
-struct VectorHash {
-    size_t operator()(const std::vector<uint32_t>& members) const {
-        size_t h = 1469598103934665603ull;
-        for (uint32_t m : members) h = (h ^ m) * 1099511628211ull;
-        return h;
-    }
-};
 
 // One member's region of one shared object, built run by run in ascending page index.
 class MemberRegion {
@@ -70,6 +62,41 @@ struct SharedObject {
     std::vector<MemberRegion> regions;  // one per member, in the same order
 };
 
+// Sets of process numbers as a trie: a set is its largest member added to the set of the
+// others. Processes are met in ascending order, so each set has one node, and a page's set grows
+// by one lookup a holder, mostly answered by the last one.
+class ProcessSets {
+public:
+    static constexpr uint32_t kEmpty = 0;
+
+    ProcessSets() { nodes_.push_back({kEmpty, UINT32_MAX, 0}); }
+    uint32_t size(uint32_t set) const { return nodes_[set].size; }
+    // The set with `process` added; `process` is at least every member's number.
+    uint32_t with(uint32_t set, uint32_t process) {
+        if (nodes_[set].last == process) return set;  // a second mapping of the page
+        if (set == lastFrom_ && process == lastProcess_) return lastTo_;
+        auto [slot, added] = children_.try_emplace(uint64_t{set} << 32 | process, static_cast<uint32_t>(nodes_.size()));
+        if (added) nodes_.push_back({set, process, nodes_[set].size + 1});
+        lastFrom_ = set, lastProcess_ = process, lastTo_ = slot->second;
+        return slot->second;
+    }
+    std::vector<uint32_t> members(uint32_t set) const {
+        std::vector<uint32_t> result(nodes_[set].size);
+        for (size_t i = result.size(); i > 0; set = nodes_[set].parent) result[--i] = nodes_[set].last;
+        return result;
+    }
+
+private:
+    struct Node {
+        uint32_t parent;
+        uint32_t last;
+        uint32_t size;
+    };
+    std::vector<Node> nodes_;
+    std::unordered_map<uint64_t, uint32_t> children_;
+    uint32_t lastFrom_ = UINT32_MAX, lastProcess_ = UINT32_MAX, lastTo_ = 0;
+};
+
 class Pass {
 public:
     explicit Pass(const std::vector<std::shared_ptr<RKProcess>>& processes) {
@@ -83,7 +110,10 @@ public:
 
     RKSharedAnonymousSummary run() {
         if (processes_.size() >= 2) {
-            merge();
+            rankPages();
+            collectSets();
+            makeObjects();
+            attributePages();
             attach();
         }
         for (RKUserProcess* process : processes_) process->releaseSharedAnonymousPages();
@@ -91,75 +121,88 @@ public:
     }
 
 private:
-    using Entry = std::pair<uint64_t, uint32_t>;  // page, process number
+    static constexpr uint32_t kNoObject = UINT32_MAX;
 
-    // One page at a time, in ascending order, across all processes' sorted lists.
-    void merge() {
-        std::vector<size_t> cursor(processes_.size(), 0);
-        std::priority_queue<Entry, std::vector<Entry>, std::greater<Entry>> heads;
-        for (uint32_t p = 0; p < processes_.size(); p++) heads.push({processes_[p]->sharedAnonymousPages()[0].page, p});
-        std::vector<std::pair<uint32_t, size_t>> holders;  // process number, index of its entry
-        while (!heads.empty()) {
-            const uint64_t page = heads.top().first;
-            holders.clear();
-            while (!heads.empty() && heads.top().first == page) {
-                const uint32_t p = heads.top().second;
-                heads.pop();
-                auto& pages = processes_[p]->sharedAnonymousPages();
-                for (; cursor[p] < pages.size() && pages[cursor[p]].page == page; cursor[p]++) holders.push_back({p, cursor[p]});
-                if (cursor[p] < pages.size()) heads.push({pages[cursor[p]].page, p});
+    void rankPages() {
+        for (RKUserProcess* process : processes_)
+            for (const RKSharedAnonymousPage& page : process->sharedAnonymousPages()) ranks_.add(page.page);
+        ranks_.seal();
+    }
+
+    // Every page's set of measured holders, and where the first of them holds it. Each process's
+    // pages are read in order, one process after another: the arrays by rank are walked ascending
+    // once a process, never one page across every process.
+    void collectSets() {
+        setOf_.assign(ranks_.size(), ProcessSets::kEmpty);
+        firstHolder_.resize(ranks_.size());
+        for (uint32_t p = 0; p < processes_.size(); p++) {
+            for (const RKSharedAnonymousPage& page : processes_[p]->sharedAnonymousPages()) {
+                const uint32_t rank = ranks_.rank(page.page);
+                if (setOf_[rank] == ProcessSets::kEmpty) firstHolder_[rank] = {p, page.range};
+                setOf_[rank] = sets_.with(setOf_[rank], p);
             }
-            attribute(holders);
         }
     }
 
-    void attribute(std::vector<std::pair<uint32_t, size_t>>& holders) {
-        std::sort(holders.begin(), holders.end());
-        members_.clear();
-        for (const auto& holder : holders)
-            if (members_.empty() || members_.back() != holder.first) members_.push_back(holder.first);
-        if (members_.size() < 2) return;  // one measured process alone: its private memory
-        summary_.sharedPages++;
-        const uint32_t setId = intern(members_);
-        // Named after the region the first member holds it in, so every member counts it alike.
-        const RKSharedAnonymousPage& first = processes_[holders[0].first]->sharedAnonymousPages()[holders[0].second];
-        const RKMemoryRegion& namedAfter = *processes_[holders[0].first]->sharedAnonymousRegions()[first.range];
-        SharedObject& object = objectFor(setId, namedAfter);
-        const uint64_t index = object.nextIndex++;
-        size_t member = 0;
-        uint32_t previous = UINT32_MAX;
-        for (const auto& [p, at] : holders) {
+    // In ascending page order: each page that two measured processes or more hold gets its
+    // object (by set and name) and its index there. One measured process alone: its private memory.
+    void makeObjects() {
+        objectOf_.assign(ranks_.size(), kNoObject);
+        indexOf_.resize(ranks_.size());
+        for (size_t rank = 0; rank < ranks_.size(); rank++) {
+            if (sets_.size(setOf_[rank]) < 2) continue;
+            summary_.sharedPages++;
+            // Named after the region the first member holds it in, so every member counts it alike.
+            const auto [p, range] = firstHolder_[rank];
+            const RKMemoryRegion& namedAfter = *processes_[p]->sharedAnonymousRegions()[range];
+            objectOf_[rank] = objectFor(setOf_[rank], namedAfter);
+            indexOf_[rank] = objects_[objectOf_[rank]].nextIndex++;
+        }
+        std::vector<uint32_t>().swap(setOf_);
+        std::vector<Holder>().swap(firstHolder_);
+    }
+
+    // Each holder's page moves from the region it was found in to its member region of the
+    // page's object, at the page's index there.
+    void attributePages() {
+        for (uint32_t p = 0; p < processes_.size(); p++) {
             RKUserProcess& process = *processes_[p];
-            const RKSharedAnonymousPage& entry = process.sharedAnonymousPages()[at];
-            RKMemoryRegion& origin = *process.sharedAnonymousRegions()[entry.range];
             const uint64_t pageSize = process.pageSize();
-            uint64_t& from = entry.swapped ? origin.swappedSize : origin.dirtySize;
-            from -= std::min(from, pageSize);
-            if (p == previous) continue;  // mapped twice by one process: one page of the object
-            previous = p;
-            while (object.members[member] != p) member++;
-            object.regions[member].add(index, entry.swapped != 0, pageSize);
+            uint32_t previous = UINT32_MAX, lastObject = kNoObject;
+            MemberRegion* region = nullptr;
+            for (const RKSharedAnonymousPage& page : process.sharedAnonymousPages()) {
+                const uint32_t rank = ranks_.rank(page.page);
+                const uint32_t object = objectOf_[rank];
+                if (object == kNoObject) continue;
+                RKMemoryRegion& origin = *process.sharedAnonymousRegions()[page.range];
+                uint64_t& from = page.swapped ? origin.swappedSize : origin.dirtySize;
+                from -= std::min(from, pageSize);
+                if (rank == previous) continue;  // mapped twice by one process: one page of the object
+                previous = rank;
+                if (object != lastObject) {
+                    SharedObject& shared = objects_[object];
+                    auto member = std::lower_bound(shared.members.begin(), shared.members.end(), p);
+                    region = &shared.regions[static_cast<size_t>(member - shared.members.begin())];
+                    lastObject = object;
+                }
+                region->add(indexOf_[rank], page.swapped != 0, pageSize);
+            }
         }
     }
 
-    uint32_t intern(const std::vector<uint32_t>& members) {
-        auto [it, added] = sets_.try_emplace(members, static_cast<uint32_t>(sets_.size()));
-        return it->second;
-    }
-
-    SharedObject& objectFor(uint32_t setId, const RKMemoryRegion& namedAfter) {
+    uint32_t objectFor(uint32_t set, const RKMemoryRegion& namedAfter) {
         auto [name, added] = names_.try_emplace(namedAfter.name + '\0' + namedAfter.detailedName,
                                                 static_cast<uint32_t>(names_.size()));
-        const uint64_t key = static_cast<uint64_t>(setId) << 32 | name->second;
-        auto [slot, made] = objectIndex_.try_emplace(key, objects_.size());
+        const uint64_t key = static_cast<uint64_t>(set) << 32 | name->second;
+        auto [slot, made] = objectIndex_.try_emplace(key, static_cast<uint32_t>(objects_.size()));
         if (made) {
             SharedObject object;
-            object.members = members_;
+            object.members = sets_.members(set);
             const uint64_t objectId = RKSharedAnonymousObjectIdBase | (objects_.size() + 1);
-            for (size_t m = 0; m < members_.size(); m++) object.regions.emplace_back(namedAfter, objectId);
+            for (size_t m = 0; m < object.members.size(); m++) object.regions.emplace_back(namedAfter, objectId);
             objects_.push_back(std::move(object));
         }
-        return objects_[slot->second];
+        return slot->second;
     }
 
     // Each member's region of each object joins that member's regions.
@@ -176,11 +219,21 @@ private:
         }
     }
 
+    struct Holder {
+        uint32_t process;
+        uint32_t range;
+    };
+
     std::vector<RKUserProcess*> processes_;
-    std::vector<uint32_t> members_;
-    std::unordered_map<std::vector<uint32_t>, uint32_t, VectorHash> sets_;
+    RKPageKeyRanks ranks_;
+    ProcessSets sets_;
+    // By page rank.
+    std::vector<uint32_t> setOf_;
+    std::vector<Holder> firstHolder_;
+    std::vector<uint32_t> objectOf_;
+    std::vector<uint64_t> indexOf_;
     std::unordered_map<std::string, uint32_t> names_;
-    std::unordered_map<uint64_t, size_t> objectIndex_;
+    std::unordered_map<uint64_t, uint32_t> objectIndex_;
     std::vector<SharedObject> objects_;
     RKSharedAnonymousSummary summary_;
 };

@@ -1,0 +1,68 @@
+#include "analysis/RKPageKeyRanks.h"
+
+#include <algorithm>
+#include <bit>
+
+#include "model/RKAssert.h"
+#include "platform/RKKernelTypes.h"
+
+RKPageKeyRanks::Chunk& RKPageKeyRanks::chunk(uint64_t frame) {
+    const uint64_t index = frame >> kChunkShift;
+    if (index != lastIndex_) {
+        std::unique_ptr<Chunk>& slot = chunks_[index];
+        if (!slot) slot = std::make_unique<Chunk>();
+        lastIndex_ = index, last_ = slot.get();
+    }
+    return *last_;
+}
+
+const RKPageKeyRanks::Chunk& RKPageKeyRanks::chunk(uint64_t frame) const {
+    const uint64_t index = frame >> kChunkShift;
+    if (index != lastIndex_) {
+        auto found = chunks_.find(index);
+        RKAssert(found != chunks_.end(), "RKPageKeyRanks", "rank of a frame that was never added");
+        lastIndex_ = index, last_ = found->second.get();
+    }
+    return *last_;
+}
+
+void RKPageKeyRanks::add(uint64_t key) {
+    if (key & RKSwappedPageKey) {
+        swapped_.push_back(key);
+        return;
+    }
+    const uint64_t offset = key & ((uint64_t{1} << kChunkShift) - 1);
+    chunk(key).bits[offset / 64] |= uint64_t{1} << (offset % 64);
+}
+
+void RKPageKeyRanks::seal() {
+    std::vector<uint64_t> order;
+    order.reserve(chunks_.size());
+    for (const auto& [index, chunk] : chunks_) order.push_back(index);
+    std::sort(order.begin(), order.end());
+    uint64_t total = 0;
+    for (uint64_t index : order) {
+        Chunk& c = *chunks_[index];
+        c.base = static_cast<uint32_t>(total);
+        uint32_t within = 0;
+        for (size_t w = 0; w < kWords; w++) {
+            c.before[w] = within;
+            within += static_cast<uint32_t>(std::popcount(c.bits[w]));
+        }
+        total += within;
+    }
+    std::sort(swapped_.begin(), swapped_.end());
+    swapped_.erase(std::unique(swapped_.begin(), swapped_.end()), swapped_.end());
+    RKAssert(total + swapped_.size() <= UINT32_MAX, "RKPageKeyRanks", "more than 2^32 distinct pages");
+    frames_ = static_cast<uint32_t>(total);
+    count_ = total + swapped_.size();
+}
+
+uint32_t RKPageKeyRanks::rank(uint64_t key) const {
+    if (key & RKSwappedPageKey)
+        return frames_ + static_cast<uint32_t>(std::lower_bound(swapped_.begin(), swapped_.end(), key) - swapped_.begin());
+    const Chunk& c = chunk(key);
+    const uint64_t offset = key & ((uint64_t{1} << kChunkShift) - 1);
+    const uint64_t below = c.bits[offset / 64] & ((uint64_t{1} << (offset % 64)) - 1);
+    return c.base + c.before[offset / 64] + static_cast<uint32_t>(std::popcount(below));
+}

@@ -1,0 +1,40 @@
+// The distinct page keys (frame numbers, or swap entries with RKSwappedPageKey set) of many
+// processes, each given its rank in ascending order, so that what is known per page can be kept
+// in plain arrays indexed by rank. Frames are bits of a bitmap allocated by chunks of 2^15
+// frames, as frames are met (a bit a frame and half a word of counts: 1/64 of a byte a frame
+// when dense); swap entries, few in practice, a sorted vector.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <unordered_map>
+#include <vector>
+
+class RKPageKeyRanks {
+public:
+    void add(uint64_t key);
+    // After the last add, before the first rank.
+    void seal();
+    // The rank of a key that was added.
+    uint32_t rank(uint64_t key) const;
+    size_t size() const { return count_; }
+
+private:
+    static constexpr unsigned kChunkShift = 15;
+    static constexpr size_t kWords = (size_t{1} << kChunkShift) / 64;
+    struct Chunk {
+        uint64_t bits[kWords] = {};
+        uint32_t before[kWords] = {};  // keys in the chunk's earlier words
+        uint32_t base = 0;             // keys in earlier chunks
+    };
+    Chunk& chunk(uint64_t frame);
+    const Chunk& chunk(uint64_t frame) const;
+
+    std::unordered_map<uint64_t, std::unique_ptr<Chunk>> chunks_;
+    // The chunk of the last key asked about: one process's keys come in ascending order.
+    mutable uint64_t lastIndex_ = UINT64_MAX;
+    mutable Chunk* last_ = nullptr;
+    std::vector<uint64_t> swapped_;
+    uint32_t frames_ = 0;
+    size_t count_ = 0;
+};

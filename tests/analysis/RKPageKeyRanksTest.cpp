@@ -1,0 +1,22 @@
+// Ranks are the keys' places in ascending order with no gaps: across words and chunks of the
+// frame bitmap, repeated keys, and swap entries after every frame.
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <vector>
+
+#include "analysis/RKPageKeyRanks.h"
+#include "platform/RKKernelTypes.h"
+
+TEST(RKPageKeyRanks, RanksAreAscendingPlacesOfTheDistinctKeys) {
+    const std::vector<uint64_t> keys = {RKSwappedPageKey | 7, 64, 5, 63, 32768, 32767, 1ull << 40, 5,
+                                        RKSwappedPageKey | 2, 0, 64, (1ull << 40) + 1};
+    RKPageKeyRanks ranks;
+    for (uint64_t key : keys) ranks.add(key);
+    ranks.seal();
+    std::vector<uint64_t> distinct = keys;
+    std::sort(distinct.begin(), distinct.end());
+    distinct.erase(std::unique(distinct.begin(), distinct.end()), distinct.end());
+    ASSERT_EQ(ranks.size(), distinct.size());
+    for (size_t i = 0; i < distinct.size(); i++) EXPECT_EQ(ranks.rank(distinct[i]), i) << distinct[i];
+}
