@@ -15,6 +15,7 @@
 #include "platform/RKLinuxPlatform.h"
 #include "platform/RKLinuxTask.h"
 #include "platform/RKPageDispositions.h"
+#include "platform/RKRadixSort.h"
 #include "platform/RKUniqueFd.h"
 
 namespace {
@@ -139,7 +140,10 @@ kern_return_t RKLinuxPlatform::sharedAnonymousPages(RKTask& task, const std::vec
     kern_return_t result = CandidateReader(pagemap.get(), kernelPageSize(), ranges, pages)
                                .read(RKProbePageReading(procRoot()).pagemapScan);
     if (result != KERN_SUCCESS) return result;
-    std::sort(pages.begin(), pages.end(), [](const auto& a, const auto& b) { return a.page < b.page; });
+    // Swapped pages, rare, sorted apart: their keys would need six passes of the radix sort.
+    auto swapped = std::stable_partition(pages.begin(), pages.end(), [](const auto& p) { return !(p.page & RKSwappedPageKey); });
+    std::sort(swapped, pages.end(), [](const auto& a, const auto& b) { return a.page < b.page; });
+    RKRadixSortByKey(std::span(pages.begin(), swapped), [](const RKSharedAnonymousPage& p) { return p.page; });
     RKUniqueFd kpagecount(::open((procRoot() + "/kpagecount").c_str(), O_RDONLY | O_CLOEXEC));
     RKUniqueFd kpageflags(::open((procRoot() + "/kpageflags").c_str(), O_RDONLY | O_CLOEXEC));
     if (!kpagecount.valid() || !kpageflags.valid()) return KERN_NOT_SUPPORTED;
