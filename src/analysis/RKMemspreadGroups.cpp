@@ -1,10 +1,11 @@
 // Sharing groups: every memory object sorted by the exact set of processes that map it.
-#include <deque>
 #include <span>
+#include <unordered_map>
 #include <unordered_set>
 
 #include "analysis/RKBatchEnumeration.h"
 #include "analysis/RKMemspread.h"
+#include "analysis/RKProcessSetTrie.h"
 #include "model/RKMemoryObject.h"
 #include "model/RKMemoryRegion.h"
 #include "model/RKProcessGroup.h"
@@ -12,35 +13,6 @@
 namespace {
 
 constexpr size_t kRegionBatchSize = 256;
-constexpr size_t kGroupsPerShownProcess = 6;
-
-// The processes that map one object, collected before interning.
-struct ObjectMappers {
-    explicit ObjectMappers(std::shared_ptr<RKMemoryObject> mapped) : object(std::move(mapped)) {}
-    std::shared_ptr<RKMemoryObject> object;
-    RKProcessGroupMinimal mappers;
-    std::shared_ptr<RKProcessGroup> group;  // the interned group of `mappers`
-};
-
-using InternSet = std::unordered_set<std::shared_ptr<RKProcessGroup>, RKProcessGroupHash, RKProcessGroupEqual>;
-
-// Objects in the order they are first met, so that the groups and their contents come out in
-// the same order on every run.
-class MapperTable {
-public:
-    explicit MapperTable(size_t expectedObjects) { index_.reserve(expectedObjects); }
-
-    ObjectMappers& entryFor(const std::shared_ptr<RKMemoryObject>& object) {
-        auto [it, inserted] = index_.try_emplace(object.get(), nullptr);
-        if (inserted) it->second = &entries_.emplace_back(object);
-        return *it->second;
-    }
-    std::deque<ObjectMappers>& entries() { return entries_; }
-
-private:
-    std::deque<ObjectMappers> entries_;  // stable addresses
-    std::unordered_map<const RKMemoryObject*, ObjectMappers*> index_;
-};
 
 // A hidden process joins a group only as a mapper of memory that a shown process owns without
 // mapping it (owned objects reached through a fake region).
@@ -58,33 +30,44 @@ RKProcessToGroupsMap RKMemspread::_generateProcessToProcessGroups() const {
         if (process->memoryRegions()) regionCount += process->memoryRegions()->size();
     }
 
-    MapperTable table(regionCount);
-    for (const auto& process : processes_) {
-        if (!process->memoryRegions()) continue;
-        const bool hidden = process->hiddenFromDisplay();
-        std::span<const std::shared_ptr<RKMemoryRegion>> regions(*process->memoryRegions());
+    // Each object's mappers as a set of process numbers, objects in the order they are first
+    // met, so that the groups and their contents come out in the same order on every run.
+    RKProcessSetTrie sets;
+    std::vector<std::shared_ptr<RKMemoryObject>> objects;
+    std::vector<uint32_t> mappersOf;
+    std::unordered_map<const RKMemoryObject*, uint32_t> indexOf;
+    objects.reserve(regionCount), mappersOf.reserve(regionCount), indexOf.reserve(regionCount);
+    for (uint32_t p = 0; p < processes_.size(); p++) {
+        const RKProcess& process = *processes_[p];
+        if (!process.memoryRegions()) continue;
+        const bool hidden = process.hiddenFromDisplay();
+        std::span<const std::shared_ptr<RKMemoryRegion>> regions(*process.memoryRegions());
         rk_enumerateObjectsWithBatchSize(regions, kRegionBatchSize, [&](const auto* batch, size_t count) {
             for (size_t i = 0; i < count; i++) {
                 std::shared_ptr<RKMemoryObject> object = batch[i]->memoryObject();
                 if (!object) continue;  // never analyzed, or released after a previous report
                 if (hidden && !hiddenProcessCounts(*object, shownPids)) continue;
-                table.entryFor(object).mappers.addProcess(process);
+                auto [slot, added] = indexOf.try_emplace(object.get(), static_cast<uint32_t>(objects.size()));
+                if (added) objects.push_back(std::move(object)), mappersOf.push_back(RKProcessSetTrie::kEmpty);
+                mappersOf[slot->second] = sets.with(mappersOf[slot->second], p);
             }
         });
     }
+    decltype(indexOf)().swap(indexOf);  // its memory, before the groups are made
 
-    InternSet interned;
-    interned.reserve(kGroupsPerShownProcess * shownPids.size());
+    // One group a distinct set of mappers, made when its first object is met.
+    std::vector<std::shared_ptr<RKProcessGroup>> groupOf(sets.count());
     RKProcessGroupList groupsInOrder;
-    for (ObjectMappers& entry : table.entries()) {
-        auto found = interned.find(entry.mappers);
-        if (found == interned.end()) {
-            found = interned.insert(entry.mappers.immutableCopy()).first;
-            groupsInOrder.push_back(*found);
+    for (size_t i = 0; i < objects.size(); i++) {
+        std::shared_ptr<RKProcessGroup>& group = groupOf[mappersOf[i]];
+        if (!group) {
+            RKProcessGroupMinimal mappers;
+            for (uint32_t p : sets.members(mappersOf[i])) mappers.addProcess(processes_[p]);
+            group = mappers.immutableCopy();
+            groupsInOrder.push_back(group);
         }
-        entry.group = *found;
+        group->addObject(objects[i]);
     }
-    for (ObjectMappers& entry : table.entries()) entry.group->addObject(entry.object);
 
     RKProcessToGroupsMap result;
     for (const auto& group : groupsInOrder) {

@@ -10,6 +10,7 @@
 
 #include "analysis/RKMemspread.h"
 #include "analysis/RKPageKeyRanks.h"
+#include "analysis/RKProcessSetTrie.h"
 #include "model/RKMemoryRegion.h"
 #include "model/RKMemoryTotal.h"
 #include "process/RKUserProcess.h"
@@ -62,41 +63,6 @@ struct SharedObject {
     std::vector<MemberRegion> regions;  // one per member, in the same order
 };
 
-// Sets of process numbers as a trie: a set is its largest member added to the set of the
-// others. Processes are met in ascending order, so each set has one node, and a page's set grows
-// by one lookup a holder, mostly answered by the last one.
-class ProcessSets {
-public:
-    static constexpr uint32_t kEmpty = 0;
-
-    ProcessSets() { nodes_.push_back({kEmpty, UINT32_MAX, 0}); }
-    uint32_t size(uint32_t set) const { return nodes_[set].size; }
-    // The set with `process` added; `process` is at least every member's number.
-    uint32_t with(uint32_t set, uint32_t process) {
-        if (nodes_[set].last == process) return set;  // a second mapping of the page
-        if (set == lastFrom_ && process == lastProcess_) return lastTo_;
-        auto [slot, added] = children_.try_emplace(uint64_t{set} << 32 | process, static_cast<uint32_t>(nodes_.size()));
-        if (added) nodes_.push_back({set, process, nodes_[set].size + 1});
-        lastFrom_ = set, lastProcess_ = process, lastTo_ = slot->second;
-        return slot->second;
-    }
-    std::vector<uint32_t> members(uint32_t set) const {
-        std::vector<uint32_t> result(nodes_[set].size);
-        for (size_t i = result.size(); i > 0; set = nodes_[set].parent) result[--i] = nodes_[set].last;
-        return result;
-    }
-
-private:
-    struct Node {
-        uint32_t parent;
-        uint32_t last;
-        uint32_t size;
-    };
-    std::vector<Node> nodes_;
-    std::unordered_map<uint64_t, uint32_t> children_;
-    uint32_t lastFrom_ = UINT32_MAX, lastProcess_ = UINT32_MAX, lastTo_ = 0;
-};
-
 class Pass {
 public:
     explicit Pass(const std::vector<std::shared_ptr<RKProcess>>& processes) {
@@ -133,12 +99,12 @@ private:
     // pages are read in order, one process after another: the arrays by rank are walked ascending
     // once a process, never one page across every process.
     void collectSets() {
-        setOf_.assign(ranks_.size(), ProcessSets::kEmpty);
+        setOf_.assign(ranks_.size(), RKProcessSetTrie::kEmpty);
         firstHolder_.resize(ranks_.size());
         for (uint32_t p = 0; p < processes_.size(); p++) {
             for (const RKSharedAnonymousPage& page : processes_[p]->sharedAnonymousPages()) {
                 const uint32_t rank = ranks_.rank(page.page);
-                if (setOf_[rank] == ProcessSets::kEmpty) firstHolder_[rank] = {p, page.range};
+                if (setOf_[rank] == RKProcessSetTrie::kEmpty) firstHolder_[rank] = {p, page.range};
                 setOf_[rank] = sets_.with(setOf_[rank], p);
             }
         }
@@ -226,7 +192,7 @@ private:
 
     std::vector<RKUserProcess*> processes_;
     RKPageKeyRanks ranks_;
-    ProcessSets sets_;
+    RKProcessSetTrie sets_;
     // By page rank.
     std::vector<uint32_t> setOf_;
     std::vector<Holder> firstHolder_;
