@@ -35,14 +35,37 @@ void RKMemoryObject::_addRegion(const std::shared_ptr<RKMemoryRegion>& region, u
         if (!processMemoryRegions_ && region->eligibleForProcessView()) processMemoryRegions_.emplace();
         if (processMemoryRegions_) (*processMemoryRegions_)[process->pid()].push_back(region);
     }
-    if (!rangeList_) rangeList_ = std::make_unique<RKRangeList>();
+    // Most objects have one region: its range list is built only when a second one comes, or
+    // for a moment when the object is finalized.
+    if (!rangeList_ && !soleRegion_) {
+        soleRegion_ = region.get();
+        soleRegionPageSize_ = pageSize;
+        return;
+    }
+    if (!rangeList_) {
+        rangeList_ = std::make_unique<RKRangeList>();
+        _mergeSoleRegion(*rangeList_);
+    }
     rangeList_->addRegion(*region, pageSize);
     region->freeSubrangeList();
 }
 
+void RKMemoryObject::_mergeSoleRegion(RKRangeList& into) {
+    into.addRegion(*soleRegion_, soleRegionPageSize_);
+    soleRegion_->freeSubrangeList();
+    soleRegion_ = nullptr;
+}
+
 void RKMemoryObject::finalizeUsingRegionDirtySize(bool useRegionDirtySize) {
     RKAssert(!accurateSizes_, "RKMemoryObject", "memory object finalized twice");
-    RKMemoryTotal merged = rangeList_ ? rangeList_->sum() : RKMemoryTotal{};
+    RKMemoryTotal merged{};
+    if (soleRegion_) {
+        RKRangeList sole;
+        _mergeSoleRegion(sole);
+        merged = sole.sum();
+    } else if (rangeList_) {
+        merged = rangeList_->sum();
+    }
 
     if (useRegionDirtySize) {
         totalDirtySize_ = 0;

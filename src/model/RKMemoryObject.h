@@ -63,7 +63,6 @@ public:
 
     const RKRegionList& memoryRegions() const { return *memoryRegions_; }
     const std::optional<RKProcessRegionMap>& processMemoryRegions() const { return processMemoryRegions_; }
-    const RKRangeList* rangeList() const { return rangeList_.get(); }
 
     // Names come from the canonical region; empty for an object without regions.
     const std::string& name() const;
@@ -79,6 +78,7 @@ private:
     bool _keepsProcessViews() const;
     void _raiseToProcessSums();
     void _nameFakeRegions();
+    void _mergeSoleRegion(RKRangeList& into);
 
     uint64_t totalDirtySize_ = 0;
     uint64_t totalCleanSize_ = 0;
@@ -90,5 +90,7 @@ private:
     std::shared_ptr<RKRegionList> memoryRegions_;
     std::optional<RKProcessRegionMap> processMemoryRegions_;
     std::unique_ptr<RKRangeList> rangeList_;
+    RKMemoryRegion* soleRegion_ = nullptr;  // the one region with pages while there is no range list
+    uint64_t soleRegionPageSize_ = 0;
     bool containsFakeRegion_ = false;
 };
