@@ -13,6 +13,7 @@
 #include "analysis/RKProcessSetTrie.h"
 #include "model/RKMemoryRegion.h"
 #include "model/RKMemoryTotal.h"
+#include "platform/RKFreedHeap.h"
 #include "process/RKUserProcess.h"
 
 namespace {
@@ -212,6 +213,7 @@ RKSharedAnonymousSummary RKAttributeSharedAnonymousPages(const std::vector<std::
 
 void RKMemspread::_attributeSharedAnonymousPages() {
     const RKSharedAnonymousSummary summary = RKAttributeSharedAnonymousPages(processes_);
+    RKReturnFreedHeap();  // the page records, freed in the arenas of the workers that read them
     if (summary.unattributedBytes == 0) return;
     // Once per measurement: how far the summary may over-count, and what makes it exact.
     std::fprintf(stderr,

@@ -1,0 +1,5 @@
+#include "platform/RKFreedHeap.h"
+
+#include <malloc.h>
+
+void RKReturnFreedHeap() { malloc_trim(0); }
