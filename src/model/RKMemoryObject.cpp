@@ -1,6 +1,7 @@
 #include "model/RKMemoryObject.h"
 
 #include <algorithm>
+#include <span>
 
 #include "model/RKAssert.h"
 #include "model/RKMemoryRegion.h"
@@ -30,11 +31,7 @@ void RKMemoryObject::_addRegion(const std::shared_ptr<RKMemoryRegion>& region, u
     // Listed (and counted as a region), but there is no VM object whose pages it could add.
     if (region->object_id == 0) return;
 
-    if (process) {
-        // Once the map exists it takes every region of every process, eligible or not.
-        if (!processMemoryRegions_ && region->eligibleForProcessView()) processMemoryRegions_.emplace();
-        if (processMemoryRegions_) (*processMemoryRegions_)[process->pid()].push_back(region);
-    }
+    if (process) _addToProcessViews(region, process->pid());
     // Most objects have one region: its range list is built only when a second one comes, or
     // for a moment when the object is finalized.
     if (!rangeList_ && !soleRegion_) {
@@ -48,6 +45,26 @@ void RKMemoryObject::_addRegion(const std::shared_ptr<RKMemoryRegion>& region, u
     }
     rangeList_->addRegion(*region, pageSize);
     region->freeSubrangeList();
+}
+
+// Once the views begin (at the first eligible region) they take every region with pages of
+// every process, eligible or not. While one process alone has regions there, no map is made:
+// they are the regions from `viewsFrom_` on.
+void RKMemoryObject::_addToProcessViews(const std::shared_ptr<RKMemoryRegion>& region, pid_t pid) {
+    if (viewsFrom_ == kNoViews) {
+        if (!region->eligibleForProcessView()) return;
+        viewsFrom_ = memoryRegions_->size() - 1;
+        viewsPid_ = pid;
+        return;
+    }
+    if (!processMemoryRegions_) {
+        if (pid == viewsPid_) return;
+        processMemoryRegions_ = std::make_unique<RKProcessRegionMap>();
+        RKRegionList& first = (*processMemoryRegions_)[viewsPid_];
+        for (size_t i = viewsFrom_; i + 1 < memoryRegions_->size(); i++)
+            if ((*memoryRegions_)[i]->object_id != 0) first.push_back((*memoryRegions_)[i]);
+    }
+    (*processMemoryRegions_)[pid].push_back(region);
 }
 
 void RKMemoryObject::_mergeSoleRegion(RKRangeList& into) {
@@ -77,7 +94,7 @@ void RKMemoryObject::finalizeUsingRegionDirtySize(bool useRegionDirtySize) {
     } else {
         totalDirtySize_ = merged.dirty;
         totalSwappedSize_ = merged.swapped;
-        if (processMemoryRegions_ && RKAnalysisSettings::breakDownPhysMemspread()) _raiseToProcessSums();
+        if (viewsFrom_ != kNoViews && RKAnalysisSettings::breakDownPhysMemspread()) _raiseToProcessSums();
     }
     totalCleanSize_ = merged.clean;
     totalReclaimableSize_ = merged.reclaimable;
@@ -85,6 +102,7 @@ void RKMemoryObject::finalizeUsingRegionDirtySize(bool useRegionDirtySize) {
     rangeList_.reset();
 
     if (processMemoryRegions_ && !_keepsProcessViews()) processMemoryRegions_.reset();
+    viewsFrom_ = kNoViews;
     if (containsFakeRegion_) _nameFakeRegions();
     accurateSizes_ = true;
 }
@@ -92,15 +110,21 @@ void RKMemoryObject::finalizeUsingRegionDirtySize(bool useRegionDirtySize) {
 // Merging by offset can report less than one process's own regions do (a process's owned
 // memory is charged in full to its regions); the object never shows less than any one process.
 void RKMemoryObject::_raiseToProcessSums() {
-    for (const auto& [pid, regions] : *processMemoryRegions_) {
+    auto raise = [this](auto&& regions) {
         uint64_t dirty = 0, swapped = 0;
         for (const auto& region : regions) {
+            if (region->object_id == 0) continue;
             dirty += region->dirtySize;
             swapped += region->swappedSize;
         }
         totalDirtySize_ = std::max(totalDirtySize_, dirty);
         totalSwappedSize_ = std::max(totalSwappedSize_, swapped);
+    };
+    if (!processMemoryRegions_) {
+        raise(std::span(*memoryRegions_).subspan(viewsFrom_));
+        return;
     }
+    for (const auto& [pid, regions] : *processMemoryRegions_) raise(regions);
 }
 
 // Views can differ only when two or more processes map the object and at least one of them

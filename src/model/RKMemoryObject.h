@@ -62,7 +62,7 @@ public:
     void setOwnerPid(pid_t pid) { ownerPid_ = pid; }
 
     const RKRegionList& memoryRegions() const { return *memoryRegions_; }
-    const std::optional<RKProcessRegionMap>& processMemoryRegions() const { return processMemoryRegions_; }
+    const RKProcessRegionMap* processMemoryRegions() const { return processMemoryRegions_.get(); }
 
     // Names come from the canonical region; empty for an object without regions.
     const std::string& name() const;
@@ -79,6 +79,7 @@ private:
     void _raiseToProcessSums();
     void _nameFakeRegions();
     void _mergeSoleRegion(RKRangeList& into);
+    void _addToProcessViews(const std::shared_ptr<RKMemoryRegion>& region, pid_t pid);
 
     uint64_t totalDirtySize_ = 0;
     uint64_t totalCleanSize_ = 0;
@@ -88,7 +89,11 @@ private:
     pid_t ownerPid_ = -1;
     uint64_t totalWiredSize_ = 0;
     std::shared_ptr<RKRegionList> memoryRegions_;
-    std::optional<RKProcessRegionMap> processMemoryRegions_;
+    // Per process, while two or more have regions since the views began.
+    std::unique_ptr<RKProcessRegionMap> processMemoryRegions_;
+    static constexpr size_t kNoViews = SIZE_MAX;
+    size_t viewsFrom_ = kNoViews;  // in memoryRegions_, until finalized
+    pid_t viewsPid_ = 0;           // of the regions since then, while there is no map
     std::unique_ptr<RKRangeList> rangeList_;
     RKMemoryRegion* soleRegion_ = nullptr;  // the one region with pages while there is no range list
     uint64_t soleRegionPageSize_ = 0;
