@@ -43,13 +43,32 @@ KeyedMap identityOf(const RKMemoryRegion& region, const RKProcess& process, RKId
     }
 }
 
-// A category map entry for `object`, made on first use.
-RKMemoryCategory& categoryFor(RKCategoryMap& categories, const RKMemoryObject& object, bool summarize) {
-    std::string key = summarize ? object.name() : object.fullName();
-    auto [it, inserted] = categories.try_emplace(std::move(key));
-    if (inserted) it->second = std::make_shared<RKMemoryCategory>(summarize);
-    return *it->second;
-}
+// The category map entries of objects, made on first use. Objects met one after another mostly
+// share their category (a process's regions of one kind): the last entry is kept, and the map
+// is searched, with a key built, only when the name changes.
+class CategoryFinder {
+public:
+    CategoryFinder(RKCategoryMap& categories, bool summarize) : categories_(categories), summarize_(summarize) {}
+
+    RKMemoryCategory& operator()(const RKMemoryObject& object) {
+        const std::string& name = object.name();
+        const std::string& detail = summarize_ ? kNoDetail : object.detailedName();
+        if (!last_ || name != lastName_ || detail != lastDetail_) {
+            auto [it, inserted] = categories_.try_emplace(summarize_ ? name : object.fullName());
+            if (inserted) it->second = std::make_shared<RKMemoryCategory>(summarize_);
+            last_ = it->second.get();
+            lastName_ = name, lastDetail_ = detail;
+        }
+        return *last_;
+    }
+
+private:
+    static inline const std::string kNoDetail;
+    RKCategoryMap& categories_;
+    const bool summarize_;
+    RKMemoryCategory* last_ = nullptr;
+    std::string lastName_, lastDetail_;
+};
 
 }  // namespace
 
@@ -170,10 +189,11 @@ std::shared_ptr<RKCategoryMap> RKMemspread::_categoriesForObjects(const RKMemory
                                                                   const RKProcess& process, uint8_t* processView,
                                                                   bool summarize) {
     auto categories = std::make_shared<RKCategoryMap>();
+    CategoryFinder categoryFor(*categories, summarize);
     uint8_t state = RKProcessViewNone;
     for (const auto& object : objects) {
         std::shared_ptr<RKMemoryObject> view = object->viewForProcess(process);
-        categoryFor(*categories, *object, summarize).addMemoryObject(view);
+        categoryFor(*object).addMemoryObject(view);
         if (state != RKProcessViewPresent && view != object) {
             state = RKProcessViewPresent;
         } else if (state == RKProcessViewNone && object->couldHaveProcessView()) {
@@ -186,13 +206,14 @@ std::shared_ptr<RKCategoryMap> RKMemspread::_categoriesForObjects(const RKMemory
 
 RKCategoryMap RKMemspread::_categoriesForAllProcessesShouldSummarize(bool summarize) const {
     RKCategoryMap categories;
+    CategoryFinder categoryFor(categories, summarize);
     std::unordered_set<const RKMemoryObject*> seen;
     for (const auto& process : processes_) {
         if (process->hiddenFromDisplay() || !process->memoryRegions()) continue;
         for (const auto& region : *process->memoryRegions()) {
             std::shared_ptr<RKMemoryObject> object = region->memoryObject();
             if (!object || !seen.insert(object.get()).second) continue;
-            categoryFor(categories, *object, summarize).addMemoryObject(object);
+            categoryFor(*object).addMemoryObject(object);
         }
     }
     return categories;
