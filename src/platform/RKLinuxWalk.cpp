@@ -195,7 +195,10 @@ kern_return_t RKLoadWalkSnapshot(RKLinuxTask& task, const std::string& procRoot,
 }
 
 void RKRecycleWalkSnapshot(std::unique_ptr<RKLinuxWalkSnapshot> snapshot) {
-    if (snapshot && snapshot->text.capacity() > tSpareText.capacity()) {
+    // The text of an ordinary process is kept for the worker's next one; a huge one is freed,
+    // not held for the rest of the run.
+    constexpr size_t kLargestSpare = 4 << 20;
+    if (snapshot && snapshot->text.capacity() > tSpareText.capacity() && snapshot->text.capacity() <= kLargestSpare) {
         snapshot->text.clear();
         tSpareText.swap(snapshot->text);
     }
