@@ -13,7 +13,7 @@ const std::string kNoName;
 
 }  // namespace
 
-RKMemoryObject::RKMemoryObject() : memoryRegions_(std::make_shared<RKRegionList>()) {}
+RKMemoryObject::RKMemoryObject() = default;
 
 void RKMemoryObject::addRegion(const std::shared_ptr<RKMemoryRegion>& region, const RKProcess& process) {
     _addRegion(region, process.pageSize(), &process);
@@ -26,7 +26,7 @@ void RKMemoryObject::addRegion(const std::shared_ptr<RKMemoryRegion>& region, ui
 void RKMemoryObject::_addRegion(const std::shared_ptr<RKMemoryRegion>& region, uint64_t pageSize,
                                 const RKProcess* process) {
     RKAssert(!accurateSizes_, "RKMemoryObject", "region added to a finalized memory object");
-    memoryRegions_->push_back(region);
+    memoryRegions_.push_back(region);
     containsFakeRegion_ = containsFakeRegion_ || region->isFake();
     // Listed (and counted as a region), but there is no VM object whose pages it could add.
     if (region->object_id == 0) return;
@@ -53,7 +53,7 @@ void RKMemoryObject::_addRegion(const std::shared_ptr<RKMemoryRegion>& region, u
 void RKMemoryObject::_addToProcessViews(const std::shared_ptr<RKMemoryRegion>& region, pid_t pid) {
     if (viewsFrom_ == kNoViews) {
         if (!region->eligibleForProcessView()) return;
-        viewsFrom_ = memoryRegions_->size() - 1;
+        viewsFrom_ = memoryRegions_.size() - 1;
         viewsPid_ = pid;
         return;
     }
@@ -61,8 +61,8 @@ void RKMemoryObject::_addToProcessViews(const std::shared_ptr<RKMemoryRegion>& r
         if (pid == viewsPid_) return;
         processMemoryRegions_ = std::make_unique<RKProcessRegionMap>();
         RKRegionList& first = (*processMemoryRegions_)[viewsPid_];
-        for (size_t i = viewsFrom_; i + 1 < memoryRegions_->size(); i++)
-            if ((*memoryRegions_)[i]->object_id != 0) first.push_back((*memoryRegions_)[i]);
+        for (size_t i = viewsFrom_; i + 1 < memoryRegions_.size(); i++)
+            if (memoryRegions_[i]->object_id != 0) first.push_back(memoryRegions_[i]);
     }
     (*processMemoryRegions_)[pid].push_back(region);
 }
@@ -87,7 +87,7 @@ void RKMemoryObject::finalizeUsingRegionDirtySize(bool useRegionDirtySize) {
     if (useRegionDirtySize) {
         totalDirtySize_ = 0;
         totalSwappedSize_ = 0;
-        for (const auto& region : *memoryRegions_) {
+        for (const auto& region : memoryRegions_) {
             totalDirtySize_ += region->dirtySize;
             totalSwappedSize_ += region->swappedSize;
         }
@@ -121,7 +121,7 @@ void RKMemoryObject::_raiseToProcessSums() {
         totalSwappedSize_ = std::max(totalSwappedSize_, swapped);
     };
     if (!processMemoryRegions_) {
-        raise(std::span(*memoryRegions_).subspan(viewsFrom_));
+        raise(std::span(memoryRegions_).subspan(viewsFrom_));
         return;
     }
     for (const auto& [pid, regions] : *processMemoryRegions_) raise(regions);
@@ -146,7 +146,7 @@ bool RKMemoryObject::_keepsProcessViews() const {
 void RKMemoryObject::_nameFakeRegions() {
     const RKMemoryRegion* canonical = _canonicalRegion();
     if (!canonical || canonical->isFake()) return;
-    for (const auto& region : *memoryRegions_) {
+    for (const auto& region : memoryRegions_) {
         if (!region->isFake()) continue;
         region->name = canonical->name;
         region->detailedName = canonical->detailedName;
@@ -189,10 +189,10 @@ std::shared_ptr<RKMemoryObject> RKMemoryObject::viewForProcess(const RKProcess& 
 }
 
 const RKMemoryRegion* RKMemoryObject::_canonicalRegion() const {
-    if (memoryRegions_->empty()) return nullptr;
-    const RKMemoryRegion* first = memoryRegions_->front().get();
+    if (memoryRegions_.empty()) return nullptr;
+    const RKMemoryRegion* first = memoryRegions_.front().get();
     if (!first->inSharedCache && ownerPid_ == -1) return first;
-    for (const auto& region : *memoryRegions_) {
+    for (const auto& region : memoryRegions_) {
         bool qualifies = first->inSharedCache ? !region->unusedSharedCacheRegion : !region->isFake();
         if (qualifies) return region.get();
     }
@@ -214,7 +214,7 @@ std::string RKMemoryObject::fullName() const {
     return canonical ? canonical->fullName() : std::string();
 }
 
-bool RKMemoryObject::verbose() const { return !memoryRegions_->empty() && memoryRegions_->front()->verbose; }
+bool RKMemoryObject::verbose() const { return !memoryRegions_.empty() && memoryRegions_.front()->verbose; }
 
 bool RKMemoryObject::couldHaveProcessView() const {
     return (processMemoryRegions_ && !processMemoryRegions_->empty()) || ownerPid_ != -1;

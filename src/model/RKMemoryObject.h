@@ -61,7 +61,7 @@ public:
     pid_t ownerPid() const { return ownerPid_; }           // -1: no owner
     void setOwnerPid(pid_t pid) { ownerPid_ = pid; }
 
-    const RKRegionList& memoryRegions() const { return *memoryRegions_; }
+    const RKRegionList& memoryRegions() const { return memoryRegions_; }
     const RKProcessRegionMap* processMemoryRegions() const { return processMemoryRegions_.get(); }
 
     // Names come from the canonical region; empty for an object without regions.
@@ -88,7 +88,7 @@ private:
     bool accurateSizes_ = false;
     pid_t ownerPid_ = -1;
     uint64_t totalWiredSize_ = 0;
-    std::shared_ptr<RKRegionList> memoryRegions_;
+    RKRegionList memoryRegions_;
     // Per process, while two or more have regions since the views began.
     std::unique_ptr<RKProcessRegionMap> processMemoryRegions_;
     static constexpr size_t kNoViews = SIZE_MAX;
