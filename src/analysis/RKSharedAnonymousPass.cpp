@@ -92,7 +92,7 @@ private:
 
     void rankPages() {
         for (RKUserProcess* process : processes_)
-            for (const RKSharedAnonymousPage& page : process->sharedAnonymousPages()) ranks_.add(page.page);
+            for (const RKSharedAnonymousPage& page : process->sharedAnonymousPages()) ranks_.add(page.page());
         ranks_.seal();
     }
 
@@ -104,7 +104,7 @@ private:
         firstHolder_.resize(ranks_.size());
         for (uint32_t p = 0; p < processes_.size(); p++) {
             for (const RKSharedAnonymousPage& page : processes_[p]->sharedAnonymousPages()) {
-                const uint32_t rank = ranks_.rank(page.page);
+                const uint32_t rank = ranks_.rank(page.page());
                 if (setOf_[rank] == RKProcessSetTrie::kEmpty) firstHolder_[rank] = {p, page.range};
                 setOf_[rank] = sets_.with(setOf_[rank], p);
             }
@@ -138,11 +138,11 @@ private:
             uint32_t previous = UINT32_MAX, lastObject = kNoObject;
             MemberRegion* region = nullptr;
             for (const RKSharedAnonymousPage& page : process.sharedAnonymousPages()) {
-                const uint32_t rank = ranks_.rank(page.page);
+                const uint32_t rank = ranks_.rank(page.page());
                 const uint32_t object = objectOf_[rank];
                 if (object == kNoObject) continue;
                 RKMemoryRegion& origin = *process.sharedAnonymousRegions()[page.range];
-                uint64_t& from = page.swapped ? origin.swappedSize : origin.dirtySize;
+                uint64_t& from = page.swapped() ? origin.swappedSize : origin.dirtySize;
                 from -= std::min(from, pageSize);
                 if (rank == previous) continue;  // mapped twice by one process: one page of the object
                 previous = rank;
@@ -152,7 +152,7 @@ private:
                     region = &shared.regions[static_cast<size_t>(member - shared.members.begin())];
                     lastObject = object;
                 }
-                region->add(indexOf_[rank], page.swapped != 0, pageSize);
+                region->add(indexOf_[rank], page.swapped(), pageSize);
             }
         }
     }

@@ -10,7 +10,7 @@
 // every member), so the range list counts the page once and the sharing groups put it with
 // exactly that set. The regions the pages came from lose them.
 //
-// Memory: the 16-byte page records the processes hold, and while the pass runs about 20 bytes a
+// Memory: the 12-byte page records the processes hold, and while the pass runs about 20 bytes a
 // distinct page; nothing per page after it. Time linear in page records.
 #pragma once
 

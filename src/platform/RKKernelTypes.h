@@ -196,12 +196,21 @@ struct RKPageQueryAbilities {
     bool frames = false;
 };
 
-// A page of private anonymous memory that other mappings may hold too (after fork, or merged
-// by KSM): its identity, the range it was found in and whether it is swapped. `page` is the
-// frame number of a present page, or the swap entry of a swapped one with RKSwappedPageKey set.
-struct RKSharedAnonymousPage {
-    uint64_t page = 0;
-    uint32_t range = 0;  // index in the ranges asked about
-    uint32_t swapped = 0;
-};
 inline constexpr uint64_t RKSwappedPageKey = 1ull << 63;
+
+// A page of private anonymous memory that other mappings may hold too (after fork, or merged
+// by KSM): its identity and the range it was found in. `page()` is the frame number of a
+// present page, or the swap entry of a swapped one with RKSwappedPageKey set. The key is kept
+// in two halves so that a record takes 12 bytes, not 16: a forking server has millions.
+struct RKSharedAnonymousPage {
+    uint32_t pageLow = 0;
+    uint32_t pageHigh = 0;
+    uint32_t range = 0;  // index in the ranges asked about
+
+    RKSharedAnonymousPage() = default;
+    RKSharedAnonymousPage(uint64_t key, uint32_t inRange)
+        : pageLow(static_cast<uint32_t>(key)), pageHigh(static_cast<uint32_t>(key >> 32)), range(inRange) {}
+    uint64_t page() const { return uint64_t{pageHigh} << 32 | pageLow; }
+    bool swapped() const { return (page() & RKSwappedPageKey) != 0; }
+};
+static_assert(sizeof(RKSharedAnonymousPage) == 12);

@@ -63,9 +63,9 @@ private:
         for (uint64_t entry : entries) {
             if (fileBacked && (entry & RKPagemapFilePage)) continue;  // page cache, not a copy
             if ((entry & RKPagemapPresent) && (entry & RKPagemapFrameMask) != 0)
-                pages_.push_back({entry & RKPagemapFrameMask, r, 0});
+                pages_.emplace_back(entry & RKPagemapFrameMask, r);
             else if (!(entry & RKPagemapPresent) && (entry & RKPagemapSwapped))
-                pages_.push_back({RKSwappedPageKey | (entry & RKPagemapFrameMask), r, 1});
+                pages_.emplace_back(RKSwappedPageKey | (entry & RKPagemapFrameMask), r);
         }
     }
 
@@ -109,10 +109,10 @@ private:
 // is sorted: the swapped ones, keyed above every frame, come last.
 void keepShared(RKFrameVerdicts& verdicts, int kpagecount, int kpageflags, std::vector<RKSharedAnonymousPage>& pages) {
     const size_t present = static_cast<size_t>(
-        std::partition_point(pages.begin(), pages.end(), [](const auto& p) { return !(p.page & RKSwappedPageKey); }) -
+        std::partition_point(pages.begin(), pages.end(), [](const auto& p) { return !p.swapped(); }) -
         pages.begin());
     std::vector<uint64_t> frames(present);
-    for (size_t i = 0; i < present; i++) frames[i] = pages[i].page;
+    for (size_t i = 0; i < present; i++) frames[i] = pages[i].page();
     std::vector<uint8_t> shared(present);
     verdicts.shared(kpagecount, kpageflags, frames, shared);
     size_t kept = 0;
@@ -141,9 +141,9 @@ kern_return_t RKLinuxPlatform::sharedAnonymousPages(RKTask& task, const std::vec
                                .read(RKProbePageReading(procRoot()).pagemapScan);
     if (result != KERN_SUCCESS) return result;
     // Swapped pages, rare, sorted apart: their keys would need six passes of the radix sort.
-    auto swapped = std::stable_partition(pages.begin(), pages.end(), [](const auto& p) { return !(p.page & RKSwappedPageKey); });
-    std::sort(swapped, pages.end(), [](const auto& a, const auto& b) { return a.page < b.page; });
-    RKRadixSortByKey(std::span(pages.begin(), swapped), [](const RKSharedAnonymousPage& p) { return p.page; });
+    auto swapped = std::stable_partition(pages.begin(), pages.end(), [](const auto& p) { return !p.swapped(); });
+    std::sort(swapped, pages.end(), [](const auto& a, const auto& b) { return a.page() < b.page(); });
+    RKRadixSortByKey(std::span(pages.begin(), swapped), [](const RKSharedAnonymousPage& p) { return p.page(); });
     RKUniqueFd kpagecount(::open((procRoot() + "/kpagecount").c_str(), O_RDONLY | O_CLOEXEC));
     RKUniqueFd kpageflags(::open((procRoot() + "/kpageflags").c_str(), O_RDONLY | O_CLOEXEC));
     if (!kpagecount.valid() || !kpageflags.valid()) return KERN_NOT_SUPPORTED;

@@ -214,9 +214,9 @@ kern_return_t RKScriptedPlatform::sharedAnonymousPages(RKTask& task, const std::
     for (uint32_t r = 0; r < ranges.size(); r++) {
         for (auto it = process->sharedAnonymous.lower_bound(ranges[r].start);
              it != process->sharedAnonymous.end() && it->first < ranges[r].start + ranges[r].size; ++it)
-            pages.push_back({it->second, r, (it->second & RKSwappedPageKey) ? 1u : 0u});
+            pages.emplace_back(it->second, r);
     }
-    std::sort(pages.begin(), pages.end(), [](const auto& a, const auto& b) { return a.page < b.page; });
+    std::sort(pages.begin(), pages.end(), [](const auto& a, const auto& b) { return a.page() < b.page(); });
     return KERN_SUCCESS;
 }
 

@@ -72,7 +72,7 @@ void captureSharedAnonymousPages(const RKUserProcess& process,
             list = static_cast<int64_t>(graph.sharedAnonymousPages.size());
             graph.sharedAnonymousPages.push_back({found->second, {}});
         }
-        graph.sharedAnonymousPages[static_cast<size_t>(list)].keys.push_back(page.page);
+        graph.sharedAnonymousPages[static_cast<size_t>(list)].keys.push_back(page.page());
     }
 }
 

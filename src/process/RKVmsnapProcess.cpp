@@ -232,12 +232,11 @@ void RKVmsnapProcess::_gatherSharedAnonymousPages(RKRegionWalkState& state) {
             sharedAnonymousRegions_.push_back(found->second);
         }
         for (uint64_t key : pages.keys)
-            sharedAnonymousPages_.push_back(
-                {key | RKVmsnapPageKeyMark, static_cast<uint32_t>(range), (key & RKSwappedPageKey) ? 1u : 0u});
+            sharedAnonymousPages_.emplace_back(key | RKVmsnapPageKeyMark, static_cast<uint32_t>(range));
     }
     // The pass merges every process's pages in key order.
     std::sort(sharedAnonymousPages_.begin(), sharedAnonymousPages_.end(),
-              [](const RKSharedAnonymousPage& a, const RKSharedAnonymousPage& b) { return a.page < b.page; });
+              [](const RKSharedAnonymousPage& a, const RKSharedAnonymousPage& b) { return a.page() < b.page(); });
 }
 
 void RKVmsnapProcess::_addUnconsumedOwnedObjectRegions(RKRegionWalkState& state) {

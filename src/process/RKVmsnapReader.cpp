@@ -17,7 +17,7 @@ using Json = nlohmann::json;
 // enough that a forged size cannot exhaust memory.
 constexpr size_t kTextLimit = size_t{1} << 31;
 // The most shared anonymous pages a snapshot may list (64 GiB of 4 KiB pages): each becomes a
-// 16-byte record, so a forged count must not decide how much memory a read takes.
+// 12-byte record, so a forged count must not decide how much memory a read takes.
 constexpr uint64_t kSharedPageLimit = uint64_t{1} << 24;
 
 struct ParseFailure {
