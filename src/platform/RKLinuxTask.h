@@ -11,6 +11,7 @@
 #include "platform/RKLinuxPageReader.h"
 #include "platform/RKLinuxVmaClassifier.h"
 #include "platform/RKPlatform.h"
+#include "platform/RKReadBuffer.h"
 #include "platform/RKSmapsParser.h"
 #include "platform/RKUniqueFd.h"
 
@@ -25,7 +26,7 @@ struct RKLinuxRegion {
 // The address space as one read of smaps saw it. The walk answers every region from it, so
 // smaps is read once per walk however many regions there are.
 struct RKLinuxWalkSnapshot {
-    std::string text;  // the smaps text the regions point into
+    RKReadBuffer text;  // the smaps text the regions point into
     std::vector<RKLinuxRegion> regions;  // ascending, non-overlapping
     // What follows the last region: KERN_INVALID_ADDRESS, or MACH_SEND_INVALID_DEST when the
     // process went away while it was read (the regions may then be only a prefix).

@@ -18,7 +18,7 @@
 
 namespace {
 
-thread_local std::string tSpareText;
+thread_local RKReadBuffer tSpareText;
 
 // Mount tables by (proc root, mount namespace): processes of one namespace share one read of
 // mountinfo. A device missing from a table makes the walk read the target's file again.
@@ -163,7 +163,7 @@ kern_return_t RKLoadWalkSnapshot(RKLinuxTask& task, const std::string& procRoot,
                                  std::unique_ptr<RKLinuxWalkSnapshot>& snapshot) {
     auto fresh = std::make_unique<RKLinuxWalkSnapshot>();
     fresh->text.swap(tSpareText);
-    int error = RKReadFileAt(task.directoryFd(), "smaps", fresh->text);
+    int error = fresh->text.readAt(task.directoryFd(), "smaps");
     if (error != 0) {
         RKRecycleWalkSnapshot(std::move(fresh));
         return readErrorCode(error);
@@ -173,7 +173,7 @@ kern_return_t RKLoadWalkSnapshot(RKLinuxTask& task, const std::string& procRoot,
         return MACH_SEND_INVALID_DEST;
     }
     std::vector<RKSmapsVma> vmas;
-    RKParseSmaps(fresh->text, vmas);
+    RKParseSmaps(fresh->text.view(), vmas);
 
     RKVmaContext context;
     context.pid = task.pid();
@@ -198,8 +198,6 @@ void RKRecycleWalkSnapshot(std::unique_ptr<RKLinuxWalkSnapshot> snapshot) {
     // The text of an ordinary process is kept for the worker's next one; a huge one is freed,
     // not held for the rest of the run.
     constexpr size_t kLargestSpare = 4 << 20;
-    if (snapshot && snapshot->text.capacity() > tSpareText.capacity() && snapshot->text.capacity() <= kLargestSpare) {
-        snapshot->text.clear();
+    if (snapshot && snapshot->text.capacity() > tSpareText.capacity() && snapshot->text.capacity() <= kLargestSpare)
         tSpareText.swap(snapshot->text);
-    }
 }

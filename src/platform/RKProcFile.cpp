@@ -14,15 +14,7 @@ int RKReadFileAt(int dirfd, const char* name, std::string& buffer) {
     if (buffer.capacity() < 4096) buffer.reserve(4096);
     size_t used = 0;
     for (;;) {
-        if (used == buffer.capacity()) {
-            // By half again, not double (which reserve does in place): while a large file (the
-            // smaps of a process with tens of thousands of mappings, tens of MB) grows, the old
-            // and new buffers are both alive.
-            std::string larger;
-            larger.reserve(buffer.capacity() + buffer.capacity() / 2);
-            larger.assign(buffer, 0, used);
-            buffer.swap(larger);
-        }
+        if (used == buffer.capacity()) buffer.reserve(buffer.capacity() * 2);
         buffer.resize(buffer.capacity());
         ssize_t n = ::read(fd.get(), buffer.data() + used, buffer.size() - used);
         if (n < 0) {
