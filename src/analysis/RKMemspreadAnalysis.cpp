@@ -1,8 +1,8 @@
 // Object identity across processes, per-process memspread numbers and categories.
 #include <algorithm>
-#include <unordered_set>
 
 #include "analysis/RKMemspread.h"
+#include "analysis/RKPointerSet.h"
 #include "model/RKMemoryCategory.h"
 #include "model/RKMemoryObject.h"
 #include "model/RKMemoryRegion.h"
@@ -153,11 +153,10 @@ uint64_t RKMemspread::_calculateMemspreadForProcess(const RKProcess& process) co
         return memspread;
     }
     // Every process that maps an object is charged its whole dirty and swapped bytes, once.
-    std::unordered_set<const RKMemoryObject*> counted;
-    counted.reserve(regions.size());
+    RKPointerSet counted(regions.size());
     for (const auto& region : regions) {
         std::shared_ptr<RKMemoryObject> object = region->memoryObject();
-        if (!object || !counted.insert(object.get()).second) continue;
+        if (!object || !counted.insert(object.get())) continue;
         memspread += object->totalDirtySize() + object->totalSwappedSize();
     }
     return memspread;
@@ -207,12 +206,12 @@ std::shared_ptr<RKCategoryMap> RKMemspread::_categoriesForObjects(const RKMemory
 RKCategoryMap RKMemspread::_categoriesForAllProcessesShouldSummarize(bool summarize) const {
     RKCategoryMap categories;
     CategoryFinder categoryFor(categories, summarize);
-    std::unordered_set<const RKMemoryObject*> seen;
+    RKPointerSet seen;
     for (const auto& process : processes_) {
         if (process->hiddenFromDisplay() || !process->memoryRegions()) continue;
         for (const auto& region : *process->memoryRegions()) {
             std::shared_ptr<RKMemoryObject> object = region->memoryObject();
-            if (!object || !seen.insert(object.get()).second) continue;
+            if (!object || !seen.insert(object.get())) continue;
             categoryFor(*object).addMemoryObject(object);
         }
     }

@@ -2,10 +2,10 @@
 
 #include <algorithm>
 #include <string>
-#include <unordered_set>
 #include <utility>
 #include <vector>
 
+#include "analysis/RKPointerSet.h"
 #include "model/RKAuxData.h"
 #include "model/RKMemoryObject.h"
 #include "model/RKMemoryRegion.h"
@@ -30,7 +30,7 @@ RKSystemMemory RKAccountForSystemMemory(const RKProcessList& processes, bool bre
 
     // Every user process's memory once: each memory object whole, by identity.
     int64_t userMemory = 0, pageTables = 0;
-    std::unordered_set<const RKMemoryObject*> seen;
+    RKPointerSet seen;
     for (const auto& process : processes) {
         if (dynamic_cast<const RKKernelProcess*>(process.get())) continue;
         if (!process->memoryRegions() || !process->errors().empty()) {
@@ -39,7 +39,7 @@ RKSystemMemory RKAccountForSystemMemory(const RKProcessList& processes, bool bre
         }
         for (const auto& region : *process->memoryRegions()) {
             std::shared_ptr<RKMemoryObject> object = region->memoryObject();
-            if (!object || !seen.insert(object.get()).second) continue;
+            if (!object || !seen.insert(object.get())) continue;
             userMemory += static_cast<int64_t>(object->totalDirtySize() + object->totalReclaimableSize() +
                                                object->totalCleanSize());
         }
