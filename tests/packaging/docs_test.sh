@@ -2,8 +2,8 @@
 # The manual pages, docs/usage.md and the usage text describe the options the parser accepts:
 # every option of the parser's tables is in the man page and in docs/usage.md; every option of
 # the usage text is one of the parser's, which leaves out only the options it hides on purpose;
-# the man page names every --sort column and -f format that the binary accepts, and says "not
-# yet" only of what the binary does not do yet; and groff reads every page without a warning.
+# the man page names every --sort column and -f format that the binary accepts; and groff reads
+# every page without a warning.
 # vmsnap's page names every option of vmsnap's usage.
 # Usage: docs_test.sh MEMSPREAD_BINARY SOURCE_DIR VMSNAP_BINARY
 set -uo pipefail
@@ -70,31 +70,6 @@ vmsnap_options=$("$vmsnap" -h | grep -oE -- '(^|[ ,])--?[A-Za-z]+' | tr -d ' ,' 
 for option in $vmsnap_options; do
     mentions "$vmsnap_text" "$option" || fail "$option is not in man/vmsnap.1"
 done
-
-# The page's sentences on what this version does not do yet must still be true, so that the page
-# changes when the feature arrives: each one that the page holds is checked against the binary.
-work=$(mktemp -d)
-trap 'rm -rf "$work"' EXIT
-man_flat=$(tr '\n' ' ' <<<"$man_text")
-# not_yet PHRASE CHECK...: when the page says PHRASE, the command CHECK must succeed.
-not_yet() {
-    local phrase=$1
-    shift
-    [[ $man_flat == *"$phrase"* ]] || return 0
-    "$@" || fail "man/memspread.1 says \"$phrase\", which is no longer true"
-}
-# The checks read the binary's messages and files, not its exit status.
-refuses_sampling() { grep -q 'not available yet' <<<"$(timeout -s INT 10 "$binary" --sample 0.1 $$ 2>&1 >/dev/null)"; }
-reads_no_snapshots() {
-    touch "$work/not a snapshot"
-    grep -q 'not supported yet' <<<"$("$binary" "$work/not a snapshot" 2>&1 >/dev/null)"
-}
-skips_the_kernel() { grep -q 'not measured yet' <<<"$("$binary" kernel 2>&1)"; }
-records_no_metrics() { "$binary" --metrilog "$work/log" $$ >/dev/null 2>&1 && [[ -f $work/log && ! -s $work/log ]]; }
-not_yet "does not sample yet" refuses_sampling
-not_yet "reads no snapshot files yet" reads_no_snapshots
-not_yet "does not measure the kernel's own memory yet" skips_the_kernel
-not_yet "records no metrics in it yet" records_no_metrics
 
 for page in "$source_dir"/man/*.[1-8]; do
     warnings=$(groff -man -ww -z "$page" 2>&1)
