@@ -6,11 +6,12 @@
 #   memspread  `memspread -a -j FILE` (text to a file too), page data and fork-shared pass
 # and print the median wall time and peak resident memory (/usr/bin/time's maxrss) of each,
 # with memspread's ratios to the floors. Ratios are what to compare: the machine may be shared.
-# memspread has no option that skips only the fork-shared pass, so it is measured with it.
 #
-#   bench/scale.sh [-b BINARY]... [-r REPS] [-x GIB] [LOAD...]       (as root)
+#   bench/scale.sh [-b BINARY]... [-o] [-r REPS] [-x GIB] [LOAD...]       (as root)
 #
-# Several -b run in turn on the same load (before and after a change), one row each.
+# Several -b run in turn on the same load (before and after a change), one row each, numbered
+# from 0. -o adds a row for each binary run with MEMSPREAD_FORK_SHARING=off (no fork-shared
+# pass), numbered with an "o".
 #
 # LOAD is CHILDREN:MAPPINGS:MIB (the parent writes MAPPINGS 64 KiB mappings and MIB MiB, then
 # forks CHILDREN times), default 200:1000:16 400:1000:16 800:1000:16 (half, 1x, double).
@@ -25,9 +26,11 @@ here=$(cd "$(dirname "$0")" && pwd)
 binaries=()
 reps=3
 huge=0
-while getopts b:r:x: option; do
+pass_off=0
+while getopts b:or:x: option; do
     case $option in
         b) binaries+=("$OPTARG") ;;
+        o) pass_off=1 ;;
         r) reps=$OPTARG ;;
         x) huge=$OPTARG ;;
         *) exit 2 ;;
@@ -41,6 +44,12 @@ loads=("$@")
 ((${#binaries[@]})) || binaries=("$here/../build-rel/src/memspread")
 for binary in "${binaries[@]}"; do
     [[ -x $binary ]] || { echo "scale.sh: no memspread at $binary" >&2; exit 1; }
+done
+# The rows: a label and the fork-sharing setting of each run of a binary.
+rows=()
+for b in "${!binaries[@]}"; do
+    rows+=("$b:on")
+    ((pass_off)) && rows+=("${b}o:off")
 done
 [[ -x /usr/bin/time ]] || { echo "scale.sh: needs /usr/bin/time (Debian package time)" >&2; exit 1; }
 
@@ -125,8 +134,10 @@ for load in "${loads[@]}"; do
     for ((i = 0; i < reps; i++)); do
         timed floor1 "$work/smaps-floor" 1 "${targets[@]}"
         timed floor2 "$work/smaps-floor" 2 "${targets[@]}"
-        for b in "${!binaries[@]}"; do
-            timed "memspread$b" sh -c "exec \"\$0\" \"\$@\" > '$work/out.txt'" "${binaries[$b]}" "${selection[@]}" \
+        for row in "${rows[@]}"; do
+            label=${row%%:*}
+            timed "memspread$label" env MEMSPREAD_FORK_SHARING="${row#*:}" \
+                sh -c "exec \"\$0\" \"\$@\" > '$work/out.txt'" "${binaries[${label%o}]}" "${selection[@]}" \
                 -j "$work/out.json"
         done
     done
@@ -136,7 +147,8 @@ for load in "${loads[@]}"; do
     f1=$(median "$work/floor1" 1)
     f2=$(median "$work/floor2" 1)
     frss=$(median "$work/floor2" 2)
-    for b in "${!binaries[@]}"; do
+    for row in "${rows[@]}"; do
+        b=${row%%:*}
         m=$(median "$work/memspread$b" 1)
         mrss=$(median "$work/memspread$b" 2)
         awk -v b="$b" -v load="$load" -v p="$processes" -v r="$regions" -v f1="$f1" -v f2="$f2" -v m="$m" \

@@ -14,6 +14,7 @@
 #include "model/RKMemoryRegion.h"
 #include "model/RKMemoryTotal.h"
 #include "platform/RKFreedHeap.h"
+#include "process/RKAnalysisSettings.h"
 #include "process/RKUserProcess.h"
 
 namespace {
@@ -218,6 +219,8 @@ void RKMemspread::_attributeSharedAnonymousPages() {
     // Once per measurement: how far the summary may over-count, and what makes it exact.
     std::fprintf(stderr,
                  "memspread: %llu bytes of anonymous memory are shared between processes (after fork or by KSM) "
-                 "and cannot be attributed without root; the summary may count them more than once\n",
-                 static_cast<unsigned long long>(summary.unattributedBytes));
+                 "and %s; the summary may count them more than once\n",
+                 static_cast<unsigned long long>(summary.unattributedBytes),
+                 RKAnalysisSettings::isForkSharingDisabled() ? "are not attributed (MEMSPREAD_FORK_SHARING=off)"
+                                                             : "cannot be attributed without root");
 }

@@ -13,6 +13,7 @@
 #include "output/RKOutputFormatterMetrilog.h"
 #include "output/RKOutputFormatterText.h"
 #include "platform/RKPlatform.h"
+#include "process/RKAnalysisSettings.h"
 
 namespace {
 
@@ -100,6 +101,7 @@ int RKMain(int argc, char** argv) {
     RKError parseError;
     std::optional<RKMemspreadArgs> args = RKMemspreadArgs::initWithArgc(argc, argv, &parseError);
     if (!args) return argumentErrorExit(parseError);
+    if (!RKAnalysisSettings::applyEnvironment("memspread")) return kExitFailure;
 
     if (args->shouldGetPhysMemspreadBreakdown()) RKMemspread::setBreakDownPhysMemspread(true);
 

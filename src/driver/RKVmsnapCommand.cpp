@@ -159,6 +159,7 @@ bool collectProcesses(const Options& options, std::vector<std::shared_ptr<RKUser
 int RKVmsnapMain(int argc, char** argv) {
     Options options;
     if (auto status = parseOptions(argc, argv, options)) return *status;
+    if (!RKAnalysisSettings::applyEnvironment("vmsnap")) return 1;
     RKAnalysisSettings::setBreakDownPhysMemspread(true);  // memspread's default mode
 
     std::vector<std::shared_ptr<RKUserProcess>> processes;

@@ -47,6 +47,7 @@ public:
     // Shared anonymous pages (RKLinuxSharedFrames.cpp).
     kern_return_t sharedAnonymousPages(RKTask& task, const std::vector<RKPageQueryRange>& ranges,
                                        std::vector<RKSharedAnonymousPage>& pages, uint64_t& sharedBytes) override;
+    uint64_t sharedAnonymousBytes(RKTask& task, const std::vector<RKPageQueryRange>& ranges) override;
 
     // Per-process figures (RKLinuxFigures.cpp).
     int pidRusage(RKTask& task, RKRusageInfo& info) override;

@@ -130,9 +130,7 @@ kern_return_t RKLinuxPlatform::sharedAnonymousPages(RKTask& task, const std::vec
     auto* target = dynamic_cast<RKLinuxTask*>(&task);
     if (!target) return KERN_INVALID_ARGUMENT;
     if (!RKProbePageReading(procRoot()).kpageflags) {
-        for (const RKPageQueryRange& range : ranges)
-            for (const auto& [start, bytes] : target->sharedAnonymousBytes)
-                if (start == range.start) sharedBytes += bytes;
+        sharedBytes = sharedAnonymousBytes(task, ranges);
         return KERN_NOT_SUPPORTED;
     }
     RKUniqueFd pagemap(::openat(target->directoryFd(), "pagemap", O_RDONLY | O_CLOEXEC));
@@ -150,4 +148,18 @@ kern_return_t RKLinuxPlatform::sharedAnonymousPages(RKTask& task, const std::vec
     keepShared(*frameVerdicts_->verdicts(), kpagecount.get(), kpageflags.get(), pages);
     pages.shrink_to_fit();
     return KERN_SUCCESS;
+}
+
+uint64_t RKLinuxPlatform::sharedAnonymousBytes(RKTask& task, const std::vector<RKPageQueryRange>& ranges) {
+    auto* target = dynamic_cast<RKLinuxTask*>(&task);
+    if (!target) return 0;
+    // Both lists ascend by start: one merge, not a search of the walk's list for every range.
+    uint64_t bytes = 0;
+    auto walked = target->sharedAnonymousBytes.begin();
+    const auto end = target->sharedAnonymousBytes.end();
+    for (const RKPageQueryRange& range : ranges) {
+        while (walked != end && walked->first < range.start) ++walked;
+        if (walked != end && walked->first == range.start) bytes += walked->second;
+    }
+    return bytes;
 }

@@ -113,6 +113,9 @@ public:
     // is gone.
     virtual kern_return_t sharedAnonymousPages(RKTask& task, const std::vector<RKPageQueryRange>& ranges,
                                                std::vector<RKSharedAnonymousPage>& pages, uint64_t& sharedBytes) = 0;
+    // What the kernel counts as shared in `ranges` (ascending, disjoint), without reading a page:
+    // the bound of what the pass across processes would attribute, for a run that skips it.
+    virtual uint64_t sharedAnonymousBytes(RKTask& task, const std::vector<RKPageQueryRange>& ranges) = 0;
 
     // ---- Per-process figures ----
     // proc_pid_rusage: 0, or the errno of the failure.

@@ -220,6 +220,12 @@ kern_return_t RKScriptedPlatform::sharedAnonymousPages(RKTask& task, const std::
     return KERN_SUCCESS;
 }
 
+uint64_t RKScriptedPlatform::sharedAnonymousBytes(RKTask& task, const std::vector<RKPageQueryRange>&) {
+    record("sharedAnonymousBytes", task.pid());
+    auto* process = find(task.pid());
+    return process ? process->sharedAnonymousBytes : 0;
+}
+
 int RKScriptedPlatform::pidRusage(RKTask& task, RKRusageInfo& info) {
     record("pidRusage", task.pid());
     auto* process = find(task.pid());

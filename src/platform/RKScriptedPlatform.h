@@ -42,7 +42,8 @@ struct RKScriptedProcess {
     // The ranges of every preparePageRangeQueries call, in order (an empty list releases).
     std::vector<std::vector<RKPageQueryRange>> preparedRanges;
     // Shared anonymous pages by page address: the frame (or RKSwappedPageKey | swap entry).
-    // sharedAnonymousResult != KERN_SUCCESS answers that, with sharedAnonymousBytes.
+    // sharedAnonymousResult != KERN_SUCCESS answers that, with sharedAnonymousBytes, which is
+    // also the answer of sharedAnonymousBytes().
     std::map<uint64_t, uint64_t> sharedAnonymous;
     kern_return_t sharedAnonymousResult = KERN_SUCCESS;
     uint64_t sharedAnonymousBytes = 0;
@@ -131,6 +132,7 @@ public:
     RKPageQueryAbilities pageQueryAbilities() override;
     kern_return_t sharedAnonymousPages(RKTask& task, const std::vector<RKPageQueryRange>& ranges,
                                        std::vector<RKSharedAnonymousPage>& pages, uint64_t& sharedBytes) override;
+    uint64_t sharedAnonymousBytes(RKTask& task, const std::vector<RKPageQueryRange>& ranges) override;
     int pidRusage(RKTask& task, RKRusageInfo& info) override;
     int ledgerTemplate(std::vector<std::string>& names) override;
     int ledgerEntries(RKTask& task, std::vector<int64_t>& balances) override;

@@ -3,6 +3,7 @@
 #include <atomic>
 #include <cerrno>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 
 #include "platform/RKPlatform.h"
@@ -13,6 +14,7 @@ enum class Cache : int { Unknown, Off, On };
 
 std::atomic<Cache> gBreakDownCache{Cache::Unknown};
 std::atomic<bool> gSharingAnalysisDisabled{false};
+std::atomic<bool> gForkSharingDisabled{false};
 
 void printErrno(const char* message, int error) {
     std::fprintf(stderr, "%s: %s\n", message, std::strerror(error));
@@ -43,5 +45,22 @@ void RKAnalysisSettings::setBreakDownPhysMemspread(bool on) {
 bool RKAnalysisSettings::isSharingAnalysisDisabled() { return gSharingAnalysisDisabled.load(); }
 
 void RKAnalysisSettings::setSharingAnalysisDisabled(bool disabled) { gSharingAnalysisDisabled.store(disabled); }
+
+bool RKAnalysisSettings::isForkSharingDisabled() { return gForkSharingDisabled.load(); }
+
+void RKAnalysisSettings::setForkSharingDisabled(bool disabled) { gForkSharingDisabled.store(disabled); }
+
+bool RKAnalysisSettings::applyEnvironment(const char* program) {
+    const char* value = std::getenv("MEMSPREAD_FORK_SHARING");
+    if (!value || std::strcmp(value, "on") == 0) {
+        setForkSharingDisabled(false);
+    } else if (std::strcmp(value, "off") == 0) {
+        setForkSharingDisabled(true);
+    } else {
+        std::fprintf(stderr, "%s: MEMSPREAD_FORK_SHARING must be on or off, not '%s'\n", program, value);
+        return false;
+    }
+    return true;
+}
 
 void RKAnalysisSettings::resetCache() { gBreakDownCache.store(Cache::Unknown); }

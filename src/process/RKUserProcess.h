@@ -53,6 +53,7 @@ struct RKRegionWalkState {
     bool hidden = false;
     bool breakDown = false;
     bool sharingAnalysisDisabled = false;
+    bool forkSharingDisabled = false;
     // Over the process's images, in ascending address order for the whole walk.
     std::shared_ptr<RKImageEnumerator> imageEnumerator;
     // Regions waiting for their subranges until the walk is over, so that the process's page

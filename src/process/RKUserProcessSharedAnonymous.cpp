@@ -24,11 +24,18 @@ bool RKUserProcess::_noteSharedAnonymousRegion(const std::shared_ptr<RKMemoryReg
     if (file ? region->dirtySize == 0 : !isAnonymousTag(info.user_tag)) return false;
     state.sharedAnonymousRegions.push_back(region);
     state.sharedAnonymousRanges.push_back(RKPageQueryRange{region->start, region->size, file, 0});
-    return RKPlatform::current().pageQueryAbilities().frames;
+    return RKPlatform::current().pageQueryAbilities().frames && !state.forkSharingDisabled;
 }
 
 void RKUserProcess::_gatherSharedAnonymousPages(RKRegionWalkState& state) {
     if (state.sharedAnonymousRanges.empty() || !task_) return;
+    if (state.forkSharingDisabled) {
+        // Only the bound: the regions keep their pages, as where frames are hidden.
+        unattributedSharedAnonymousBytes_ = RKPlatform::current().sharedAnonymousBytes(*task_, state.sharedAnonymousRanges);
+        state.sharedAnonymousRegions.clear();
+        state.sharedAnonymousRanges.clear();
+        return;
+    }
     uint64_t sharedBytes = 0;
     kern_return_t result = RKPlatform::current().sharedAnonymousPages(*task_, state.sharedAnonymousRanges,
                                                                      sharedAnonymousPages_, sharedBytes);

@@ -179,6 +179,7 @@ void RKUserProcess::_gatherMemoryData() {
     state.hidden = hiddenFromDisplay();
     state.breakDown = breakDownPhysMemspread();
     state.sharingAnalysisDisabled = RKAnalysisSettings::isSharingAnalysisDisabled();
+    state.forkSharingDisabled = RKAnalysisSettings::isForkSharingDisabled();
     if (images_) state.imageEnumerator = std::make_shared<RKImageEnumerator>(*images_);
     enumerateRegions([&](uint64_t start, uint64_t size, const RKRegionSubmapInfo& info, int purgeState,
                          const std::optional<std::string>& path, const std::optional<std::string>& name,

@@ -3,6 +3,7 @@
 // came from; a page one measured process holds alone stays its own.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <set>
 
 #include "analysis/RKAnalysisTypes.h"
@@ -92,21 +93,36 @@ TEST_F(RKSharedAnonymousPassTest, EachPageInTheGroupOfExactlyItsHolders) {
         EXPECT_TRUE(std::dynamic_pointer_cast<RKUserProcess>(process)->sharedAnonymousPages().capacity() == 0u);
 }
 
-TEST_F(RKSharedAnonymousPassTest, HiddenFramesLeaveTheNumbersAndWarnOnce) {
-    platform->pageAbilities.frames = false;
-    addProcess(10, {});
-    addProcess(11, {});
-    for (pid_t pid : {10, 11}) {
-        platform->find(pid)->sharedAnonymousResult = KERN_NOT_SUPPORTED;
-        platform->find(pid)->sharedAnonymousBytes = 6 * P;
+// Frames hidden (no root), or the pass turned off: the regions keep their pages, and one line
+// gives the bound of what may count more than once. Turned off, not a frame is read.
+TEST_F(RKSharedAnonymousPassTest, HiddenFramesOrThePassOffLeaveTheNumbersAndWarnOnce) {
+    for (bool off : {false, true}) {
+        SCOPED_TRACE(off ? "off" : "hidden");
+        platform = std::make_shared<RKScriptedPlatform>();
+        RKScopedPlatform fresh{platform};
+        platform->selfRegionValue = 1;
+        RKAnalysisSettings::resetCache();
+        platform->pageAbilities.frames = off;
+        RKAnalysisSettings::setForkSharingDisabled(off);
+        addProcess(10, {{0, 100}});
+        addProcess(11, {{0, 100}});
+        for (pid_t pid : {10, 11}) {
+            if (!off) platform->find(pid)->sharedAnonymousResult = KERN_NOT_SUPPORTED;
+            platform->find(pid)->sharedAnonymousBytes = 6 * P;
+        }
+        RKMemspread memspread({RKProcess::processWithPid(10), RKProcess::processWithPid(11)});
+        testing::internal::CaptureStderr();
+        analyze(memspread);
+        RKAnalysisSettings::setForkSharingDisabled(false);
+        EXPECT_EQ(testing::internal::GetCapturedStderr(),
+                  std::string("memspread: 49152 bytes of anonymous memory are shared between processes (after fork or "
+                              "by KSM) and ") +
+                      (off ? "are not attributed (MEMSPREAD_FORK_SHARING=off)" : "cannot be attributed without root") +
+                      "; the summary may count them more than once\n");
+        for (pid_t pid : {10, 11}) EXPECT_EQ(memspread.pidToMemspread().at(pid), 8 * P);
+        const std::vector<std::string> calls = platform->calls();
+        EXPECT_EQ(std::count(calls.begin(), calls.end(), "sharedAnonymousPages 10"), off ? 0 : 1);
     }
-    RKMemspread memspread({RKProcess::processWithPid(10), RKProcess::processWithPid(11)});
-    testing::internal::CaptureStderr();
-    analyze(memspread);
-    EXPECT_EQ(testing::internal::GetCapturedStderr(),
-              "memspread: 49152 bytes of anonymous memory are shared between processes (after fork or by KSM) "
-              "and cannot be attributed without root; the summary may count them more than once\n");
-    for (pid_t pid : {10, 11}) EXPECT_EQ(memspread.pidToMemspread().at(pid), 8 * P);
 }
 
 }  // namespace

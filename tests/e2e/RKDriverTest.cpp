@@ -134,6 +134,13 @@ TEST_F(RKDriverTest, FailedStartRemovesEveryNamedOutputFileAndARunReplacesThem) 
               "Unable to open mlwriter: No such file or directory\nUnable to create metrilog output\n");
     EXPECT_FALSE(fs::exists(json));
 
+    // A setting in the environment that means nothing stops the run before any file is made.
+    RKCommandResult badSetting =
+        RKRunCommand({"/usr/bin/env", "MEMSPREAD_FORK_SHARING=no", MEMSPREAD_BINARY, "-j", json, "1"});
+    EXPECT_TRUE(badSetting.exitedWith(1));
+    EXPECT_EQ(badSetting.standardError, "memspread: MEMSPREAD_FORK_SHARING must be on or off, not 'no'\n");
+    EXPECT_FALSE(fs::exists(json));
+
     // One target found is enough to run.
     existingFile("out.json");
     RKCommandResult found =
