@@ -186,6 +186,9 @@ struct RKPageQueryRange {
     uint64_t size = 0;
     bool fileBacked = false;
     uint64_t reusablePages = 0;
+    // Pages the walk saw resident or swapped in the range: where that is every page, there is no
+    // hole for a scan to skip, and it sizes what the reading keeps.
+    uint64_t presentPages = 0;
 };
 
 // What this system's page queries see.

@@ -20,8 +20,8 @@
 
 namespace {
 
-// Ranges up to this many pages are read from pagemap directly: a scan first costs a second
-// system call for pages that are nearly all there.
+// Ranges up to this many pages, and larger ones whose every page is present, are read from
+// pagemap directly: a scan first costs a second walk of pages that are nearly all there.
 constexpr uint64_t kDirectPages = 512;
 // Small ranges this close together (mappings a guard page apart) share one read, up to a read's
 // worth of entries.
@@ -37,8 +37,11 @@ public:
     // Every present page (by frame) and swapped page (by swap entry) of the ranges. Where the
     // kernel has PAGEMAP_SCAN, a large range's pagemap is read only where it found pages.
     kern_return_t read(bool scan) {
+        uint64_t present = 0;
+        for (const RKPageQueryRange& range : ranges_) present += range.presentPages;
+        pages_.reserve(present);
         for (uint32_t r = 0; r < ranges_.size();) {
-            if (scan && pages(r) > kDirectPages) {
+            if (scan && pages(r) > kDirectPages && ranges_[r].presentPages < pages(r)) {
                 kern_return_t result = scanRange(r++);
                 if (result != KERN_SUCCESS) return result;
                 continue;

@@ -23,7 +23,8 @@ bool RKUserProcess::_noteSharedAnonymousRegion(const std::shared_ptr<RKMemoryReg
     const bool file = info.external_pager != 0;
     if (file ? region->dirtySize == 0 : !isAnonymousTag(info.user_tag)) return false;
     state.sharedAnonymousRegions.push_back(region);
-    state.sharedAnonymousRanges.push_back(RKPageQueryRange{region->start, region->size, file, 0});
+    state.sharedAnonymousRanges.push_back(
+        RKPageQueryRange{region->start, region->size, file, 0, info.pages_resident + info.pages_swapped_out});
     return RKPlatform::current().pageQueryAbilities().frames && !state.forkSharingDisabled;
 }
 
