@@ -149,7 +149,6 @@ kern_return_t RKLinuxPlatform::sharedAnonymousPages(RKTask& task, const std::vec
     RKUniqueFd kpageflags(::open((procRoot() + "/kpageflags").c_str(), O_RDONLY | O_CLOEXEC));
     if (!kpagecount.valid() || !kpageflags.valid()) return KERN_NOT_SUPPORTED;
     keepShared(*frameVerdicts_->verdicts(), kpagecount.get(), kpageflags.get(), pages);
-    pages.shrink_to_fit();
     return KERN_SUCCESS;
 }
 

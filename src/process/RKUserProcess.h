@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "platform/RKPlatform.h"
+#include "platform/RKSharedPageList.h"
 #include "process/RKProcess.h"
 
 class RKImage;
@@ -156,8 +157,7 @@ public:
     virtual void _gatherSharedAnonymousPages(RKRegionWalkState& state);
     // The shared pages, sorted by page; `range` indexes sharedAnonymousRegions(). Held from
     // gathering until the pass across processes has attributed them.
-    std::vector<RKSharedAnonymousPage>& sharedAnonymousPages() { return sharedAnonymousPages_; }
-    const std::vector<RKSharedAnonymousPage>& sharedAnonymousPages() const { return sharedAnonymousPages_; }
+    const RKSharedPageList& sharedAnonymousPages() const { return sharedAnonymousPages_; }
     const std::vector<std::shared_ptr<RKMemoryRegion>>& sharedAnonymousRegions() const { return sharedAnonymousRegions_; }
     void releaseSharedAnonymousPages();
     // Anonymous bytes shared with other mappings that could not be attributed (frames hidden).
@@ -224,7 +224,7 @@ protected:
     // Not owned: the region lives in the walk's region list until the walk is over.
     RKMemoryRegion* pendingUnusedSharedRegion_ = nullptr;
     bool pageQueryFailed_ = false;  // a page query failed: the process is gone or unreadable
-    std::vector<RKSharedAnonymousPage> sharedAnonymousPages_;
+    RKSharedPageList sharedAnonymousPages_;
     std::vector<std::shared_ptr<RKMemoryRegion>> sharedAnonymousRegions_;
     uint64_t unattributedSharedAnonymousBytes_ = 0;
 

@@ -38,12 +38,13 @@ void RKUserProcess::_gatherSharedAnonymousPages(RKRegionWalkState& state) {
         return;
     }
     uint64_t sharedBytes = 0;
-    kern_return_t result = RKPlatform::current().sharedAnonymousPages(*task_, state.sharedAnonymousRanges,
-                                                                     sharedAnonymousPages_, sharedBytes);
+    std::vector<RKSharedAnonymousPage> pages;
+    kern_return_t result =
+        RKPlatform::current().sharedAnonymousPages(*task_, state.sharedAnonymousRanges, pages, sharedBytes);
     if (result == KERN_SUCCESS) {
+        sharedAnonymousPages_ = RKSharedPageList(std::move(pages));
         sharedAnonymousRegions_ = std::move(state.sharedAnonymousRegions);
     } else {
-        sharedAnonymousPages_.clear();
         if (result == KERN_NOT_SUPPORTED) {
             unattributedSharedAnonymousBytes_ = sharedBytes;
         } else if (!pageQueryFailed_) {
@@ -56,7 +57,7 @@ void RKUserProcess::_gatherSharedAnonymousPages(RKRegionWalkState& state) {
 }
 
 void RKUserProcess::releaseSharedAnonymousPages() {
-    // Swapped with empty vectors: assigning {} would keep their capacity, the records' memory.
-    std::vector<RKSharedAnonymousPage>().swap(sharedAnonymousPages_);
+    // Swapped with an empty vector: assigning {} would keep its capacity.
+    sharedAnonymousPages_.release();
     RKRegionList().swap(sharedAnonymousRegions_);
 }

@@ -221,22 +221,19 @@ void RKVmsnapProcess::_gatherSharedAnonymousPages(RKRegionWalkState& state) {
     std::unordered_map<const RKMemoryRegion*, std::shared_ptr<RKMemoryRegion>> owner;
     for (const auto& region : state.regions) owner.emplace(region.get(), region);
     std::vector<int64_t> rangeOfSaved(graph_.regions.size(), -1);  // saved region -> range, or -1
-    sharedAnonymousPages_.clear();
+    std::vector<RKSharedAnonymousPage> pages;
     sharedAnonymousRegions_.clear();
-    for (const RKVmsnapSharedPages& pages : graph_.sharedAnonymousPages) {
-        int64_t& range = rangeOfSaved[pages.region];
+    for (const RKVmsnapSharedPages& saved : graph_.sharedAnonymousPages) {
+        int64_t& range = rangeOfSaved[saved.region];
         if (range < 0) {
-            auto found = owner.find(pages.region < built.size() ? built[pages.region] : nullptr);
+            auto found = owner.find(saved.region < built.size() ? built[saved.region] : nullptr);
             if (found == owner.end()) continue;  // the walk made no region of it
             range = static_cast<int64_t>(sharedAnonymousRegions_.size());
             sharedAnonymousRegions_.push_back(found->second);
         }
-        for (uint64_t key : pages.keys)
-            sharedAnonymousPages_.emplace_back(key | RKVmsnapPageKeyMark, static_cast<uint32_t>(range));
+        for (uint64_t key : saved.keys) pages.emplace_back(key | RKVmsnapPageKeyMark, static_cast<uint32_t>(range));
     }
-    // The pass merges every process's pages in key order.
-    std::sort(sharedAnonymousPages_.begin(), sharedAnonymousPages_.end(),
-              [](const RKSharedAnonymousPage& a, const RKSharedAnonymousPage& b) { return a.page() < b.page(); });
+    sharedAnonymousPages_ = RKSharedPageList(std::move(pages));  // sorted there, by key
 }
 
 void RKVmsnapProcess::_addUnconsumedOwnedObjectRegions(RKRegionWalkState& state) {

@@ -225,9 +225,11 @@ TEST_F(RKVmsnapTest, SavedSharedPagesMeetAcrossSnapshotsAsLiveFramesDo) {
     auto processes = pair(true);
     ASSERT_EQ(processes.size(), 2u);
     auto& parent = dynamic_cast<RKVmsnapProcess&>(*processes[0]);
-    ASSERT_EQ(parent.sharedAnonymousPages().size(), 2u);
-    EXPECT_EQ(parent.sharedAnonymousPages()[0].page(), 100 | RKVmsnapPageKeyMark) << "never a live process's frame";
-    EXPECT_TRUE(parent.sharedAnonymousPages()[1].swapped());
+    const std::vector<RKSharedAnonymousPage> pages(parent.sharedAnonymousPages().begin(),
+                                                   parent.sharedAnonymousPages().end());
+    ASSERT_EQ(pages.size(), 2u);
+    EXPECT_EQ(pages[0].page(), 100 | RKVmsnapPageKeyMark) << "never a live process's frame";
+    EXPECT_TRUE(pages[1].swapped());
     EXPECT_EQ(parent.sharedAnonymousRegions()[0]->name, "heap");
 
     RKSharedAnonymousSummary summary = RKAttributeSharedAnonymousPages(processes);

@@ -1,0 +1,56 @@
+// The packed list gives back exactly the records it was given, in key order, across every width
+// of difference (equal keys, one byte, several, the jump to swap entries at the top bit) and of
+// range index.
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <random>
+#include <vector>
+
+#include "platform/RKSharedPageList.h"
+
+namespace {
+
+using Record = std::pair<uint64_t, uint32_t>;
+
+std::vector<Record> unpacked(const RKSharedPageList& list) {
+    std::vector<Record> records;
+    for (const RKSharedAnonymousPage& page : list) records.emplace_back(page.page(), page.range);
+    return records;
+}
+
+}  // namespace
+
+TEST(RKSharedPageList, GivesBackTheRecordsInKeyOrder) {
+    std::mt19937_64 random(11);
+    std::vector<RKSharedAnonymousPage> pages;
+    uint64_t frame = 0;
+    for (int i = 0; i < 3000; i++) {
+        frame += random() % 4 == 0 ? 0 : uint64_t{1} << (random() % 40);
+        pages.emplace_back(frame, static_cast<uint32_t>(random() >> (32 + random() % 32)));
+    }
+    pages.emplace_back(RKSwappedPageKey | 5, 0);
+    pages.emplace_back(~uint64_t{0}, UINT32_MAX);
+    std::shuffle(pages.begin(), pages.end(), random);  // sorted by the list itself
+
+    std::vector<Record> expected;
+    for (const auto& page : pages) expected.emplace_back(page.page(), page.range);
+    std::stable_sort(expected.begin(), expected.end(), [](auto& a, auto& b) { return a.first < b.first; });
+
+    RKSharedPageList list(pages);
+    EXPECT_EQ(list.size(), pages.size());
+    std::vector<Record> actual = unpacked(list);
+    ASSERT_EQ(actual.size(), expected.size());
+    EXPECT_TRUE(std::is_sorted(actual.begin(), actual.end(), [](auto& a, auto& b) { return a.first < b.first; }));
+    // Equal keys may come in any order of their ranges.
+    std::sort(actual.begin(), actual.end());
+    std::sort(expected.begin(), expected.end());
+    EXPECT_EQ(actual, expected);
+    EXPECT_LT(list.capacity(), pages.size() * sizeof(RKSharedAnonymousPage));
+
+    list.release();
+    EXPECT_TRUE(list.empty());
+    EXPECT_EQ(list.capacity(), 0u);
+    EXPECT_TRUE(unpacked(list).empty());
+    EXPECT_TRUE(unpacked(RKSharedPageList()).empty());
+}
