@@ -23,34 +23,34 @@ std::vector<Record> unpacked(const RKSharedPageList& list) {
 
 TEST(RKSharedPageList, GivesBackTheRecordsInKeyOrder) {
     std::mt19937_64 random(11);
-    std::vector<RKSharedAnonymousPage> pages;
-    uint64_t frame = 0;
-    for (int i = 0; i < 3000; i++) {
-        frame += random() % 4 == 0 ? 0 : uint64_t{1} << (random() % 40);
-        pages.emplace_back(frame, static_cast<uint32_t>(random() >> (32 + random() % 32)));
+    for (uint32_t largestRange : {uint32_t{UINT16_MAX}, UINT32_MAX}) {  // ranges in two bytes, or four
+        SCOPED_TRACE(largestRange);
+        std::vector<RKSharedAnonymousPage> pages;
+        uint64_t frame = 0;
+        for (int i = 0; i < 3000; i++) {
+            frame += random() % 4 == 0 ? 0 : uint64_t{1} << (random() % 40);
+            pages.emplace_back(frame, static_cast<uint32_t>(random() % (uint64_t{largestRange} + 1) >> (random() % 32)));
+        }
+        pages.emplace_back(RKSwappedPageKey | 5, largestRange);
+        pages.emplace_back(~uint64_t{0}, 0);
+        std::shuffle(pages.begin(), pages.end(), random);  // sorted by the list itself
+
+        std::vector<Record> expected;
+        for (const auto& page : pages) expected.emplace_back(page.page(), page.range);
+        std::sort(expected.begin(), expected.end());
+
+        RKSharedPageList list(pages);
+        EXPECT_EQ(list.size(), pages.size());
+        std::vector<Record> actual = unpacked(list);
+        EXPECT_TRUE(std::is_sorted(actual.begin(), actual.end(), [](auto& a, auto& b) { return a.first < b.first; }));
+        std::sort(actual.begin(), actual.end());  // equal keys may come in any order of their ranges
+        EXPECT_EQ(actual, expected);
+        EXPECT_LT(list.capacity(), pages.size() * sizeof(RKSharedAnonymousPage));
+
+        list.release();
+        EXPECT_TRUE(list.empty());
+        EXPECT_EQ(list.capacity(), 0u);
+        EXPECT_TRUE(unpacked(list).empty());
     }
-    pages.emplace_back(RKSwappedPageKey | 5, 0);
-    pages.emplace_back(~uint64_t{0}, UINT32_MAX);
-    std::shuffle(pages.begin(), pages.end(), random);  // sorted by the list itself
-
-    std::vector<Record> expected;
-    for (const auto& page : pages) expected.emplace_back(page.page(), page.range);
-    std::stable_sort(expected.begin(), expected.end(), [](auto& a, auto& b) { return a.first < b.first; });
-
-    RKSharedPageList list(pages);
-    EXPECT_EQ(list.size(), pages.size());
-    std::vector<Record> actual = unpacked(list);
-    ASSERT_EQ(actual.size(), expected.size());
-    EXPECT_TRUE(std::is_sorted(actual.begin(), actual.end(), [](auto& a, auto& b) { return a.first < b.first; }));
-    // Equal keys may come in any order of their ranges.
-    std::sort(actual.begin(), actual.end());
-    std::sort(expected.begin(), expected.end());
-    EXPECT_EQ(actual, expected);
-    EXPECT_LT(list.capacity(), pages.size() * sizeof(RKSharedAnonymousPage));
-
-    list.release();
-    EXPECT_TRUE(list.empty());
-    EXPECT_EQ(list.capacity(), 0u);
-    EXPECT_TRUE(unpacked(list).empty());
     EXPECT_TRUE(unpacked(RKSharedPageList()).empty());
 }
