@@ -50,6 +50,11 @@ void RKMemspread::_addUnheldMemoryWarnings(const RKProcessList& sortedByPidDesc)
 
 bool RKMemspread::gatherData() {
     RKProcessList sorted = _processesBySortingPidDesc(processes_);
+    // The work goes costliest first; pids order only what a cancel leaves out, which is decided
+    // by the order the processes start in, so ties keep the pid order.
+    RKProcessList work = sorted;
+    std::stable_sort(work.begin(), work.end(),
+                     [](const auto& a, const auto& b) { return a->gatherCostHint() > b->gatherCostHint(); });
     RKGatherScope gather;
     gatherStartTime_ = RKTime::now();
     std::atomic<bool> cancelled{false};
@@ -62,7 +67,7 @@ bool RKMemspread::gatherData() {
             cancelled.store(true);
             return;
         }
-        sorted[i]->gatherData();
+        work[i]->gatherData();
     });
     if (cancelled.load()) sorted.back()->_addGlobalError(kEarlyExitError);
     _addUnheldMemoryWarnings(sorted);

@@ -48,6 +48,9 @@ public:
     // Why the task could not be opened (a kern_return_t); KERN_FAILURE when nothing was tried.
     kern_return_t taskResult() const { return taskResult_; }
     virtual void gatherData() {}
+    // How much gathering this process is likely to cost, in no particular unit: the workers take
+    // the costly ones first, so that none is left alone on one core at the end. 0: unknown.
+    virtual uint64_t gatherCostHint() const { return 0; }
 
     const std::vector<std::string>& globalErrors() const { return globalErrors_; }
     const std::vector<std::string>& globalWarnings() const { return globalWarnings_; }

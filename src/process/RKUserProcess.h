@@ -199,6 +199,9 @@ public:
     uint64_t phys_memspread() const { return phys_memspread_; }
     void setPhys_memspread(uint64_t value) { phys_memspread_ = value; }
     uint64_t phys_memspread_peak() const { return phys_memspread_peak_; }
+    // Its resident memory, which the smaps walk and the page reads grow with; known before
+    // gathering at no cost.
+    uint64_t gatherCostHint() const override { return phys_memspread_; }
     uint64_t ledgers() const { return ledgers_; }
     using RKImageList = std::vector<std::shared_ptr<RKImage>>;
     const std::optional<RKImageList>& images() const { return images_; }
