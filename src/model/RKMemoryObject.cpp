@@ -201,12 +201,12 @@ const RKMemoryRegion* RKMemoryObject::_canonicalRegion() const {
 
 const std::string& RKMemoryObject::name() const {
     const RKMemoryRegion* canonical = _canonicalRegion();
-    return canonical ? canonical->name : kNoName;
+    return canonical ? canonical->name.str() : kNoName;
 }
 
 const std::string& RKMemoryObject::detailedName() const {
     const RKMemoryRegion* canonical = _canonicalRegion();
-    return canonical ? canonical->detailedName : kNoName;
+    return canonical ? canonical->detailedName.str() : kNoName;
 }
 
 std::string RKMemoryObject::fullName() const {
