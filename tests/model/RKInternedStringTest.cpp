@@ -40,7 +40,8 @@ TEST(RKInternedString, EqualStringsShareOneEntryUntilTheLastHandleGoes) {
     EXPECT_EQ(RKInternedString::entryCount(), before + 1);
 }
 
-TEST(RKInternedString, ThreadsInterningAndDroppingKeepCountsExact) {
+// Gathering workers name regions in parallel.
+TEST(RKInternedString, GatheringThreadsInterningAndDroppingKeepCountsExact) {
     constexpr int kThreads = 4;
     constexpr int kRounds = 20000;
     const size_t before = RKInternedString::entryCount();
