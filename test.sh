@@ -18,10 +18,11 @@ run_suite() {
     (cd "$dir" && ctest --output-on-failure -j 2 --timeout 600)
 }
 
-# The tests whose threads meet: gathering (worker pool, cancel), sampling (timer, analysis
-# queue), and the end-to-end runs of -a, whose binary is then built under ThreadSanitizer too.
+# The tests whose threads meet: gathering (worker pool, cancel, the names workers intern),
+# sampling (timer, analysis queue), and the end-to-end runs of -a, whose binary is then built
+# under ThreadSanitizer too.
 # Picked by name, so that tests named so join by themselves.
-tsan_test_binaries=(analysis_tests driver_tests e2e_tests)
+tsan_test_binaries=(model_tests analysis_tests driver_tests e2e_tests)
 tsan_test_names='Gather|Cancel|Sampl|RKAllProcesses.EveryProcess|UnderAll'
 
 run_tsan_suite() {

@@ -13,6 +13,9 @@ const std::string kNoName;
 
 }  // namespace
 
+// Nearly one per mapping: see RKMemoryRegion.cpp.
+static_assert(sizeof(void*) != 8 || sizeof(RKMemoryObject) <= 120);
+
 RKMemoryObject::RKMemoryObject() = default;
 
 void RKMemoryObject::addRegion(const std::shared_ptr<RKMemoryRegion>& region, const RKProcess& process) {
@@ -34,9 +37,10 @@ void RKMemoryObject::_addRegion(const std::shared_ptr<RKMemoryRegion>& region, u
     if (process) _addToProcessViews(region, process->pid());
     // Most objects have one region: its range list is built only when a second one comes, or
     // for a moment when the object is finalized.
-    if (!rangeList_ && !soleRegion_) {
-        soleRegion_ = region.get();
-        soleRegionPageSize_ = pageSize;
+    if (!rangeList_ && soleRegion_ == kNone) {
+        RKAssert(pageSize <= UINT32_MAX, "RKMemoryObject", "page size within 32 bits");
+        soleRegion_ = static_cast<uint32_t>(memoryRegions_.size() - 1);
+        soleRegionPageSize_ = static_cast<uint32_t>(pageSize);
         return;
     }
     if (!rangeList_) {
@@ -51,9 +55,9 @@ void RKMemoryObject::_addRegion(const std::shared_ptr<RKMemoryRegion>& region, u
 // every process, eligible or not. While one process alone has regions there, no map is made:
 // they are the regions from `viewsFrom_` on.
 void RKMemoryObject::_addToProcessViews(const std::shared_ptr<RKMemoryRegion>& region, pid_t pid) {
-    if (viewsFrom_ == kNoViews) {
+    if (viewsFrom_ == kNone) {
         if (!region->eligibleForProcessView()) return;
-        viewsFrom_ = memoryRegions_.size() - 1;
+        viewsFrom_ = static_cast<uint32_t>(memoryRegions_.size() - 1);
         viewsPid_ = pid;
         return;
     }
@@ -68,15 +72,16 @@ void RKMemoryObject::_addToProcessViews(const std::shared_ptr<RKMemoryRegion>& r
 }
 
 void RKMemoryObject::_mergeSoleRegion(RKRangeList& into) {
-    into.addRegion(*soleRegion_, soleRegionPageSize_);
-    soleRegion_->freeSubrangeList();
-    soleRegion_ = nullptr;
+    RKMemoryRegion& sole = *memoryRegions_[soleRegion_];
+    into.addRegion(sole, soleRegionPageSize_);
+    sole.freeSubrangeList();
+    soleRegion_ = kNone;
 }
 
 void RKMemoryObject::finalizeUsingRegionDirtySize(bool useRegionDirtySize) {
     RKAssert(!accurateSizes_, "RKMemoryObject", "memory object finalized twice");
     RKMemoryTotal merged{};
-    if (soleRegion_) {
+    if (soleRegion_ != kNone) {
         RKRangeList sole;
         _mergeSoleRegion(sole);
         merged = sole.sum();
@@ -94,7 +99,7 @@ void RKMemoryObject::finalizeUsingRegionDirtySize(bool useRegionDirtySize) {
     } else {
         totalDirtySize_ = merged.dirty;
         totalSwappedSize_ = merged.swapped;
-        if (viewsFrom_ != kNoViews && RKAnalysisSettings::breakDownPhysMemspread()) _raiseToProcessSums();
+        if (viewsFrom_ != kNone && RKAnalysisSettings::breakDownPhysMemspread()) _raiseToProcessSums();
     }
     totalCleanSize_ = merged.clean;
     totalReclaimableSize_ = merged.reclaimable;
@@ -102,7 +107,7 @@ void RKMemoryObject::finalizeUsingRegionDirtySize(bool useRegionDirtySize) {
     rangeList_.reset();
 
     if (processMemoryRegions_ && !_keepsProcessViews()) processMemoryRegions_.reset();
-    viewsFrom_ = kNoViews;
+    viewsFrom_ = kNone;
     if (containsFakeRegion_) _nameFakeRegions();
     accurateSizes_ = true;
 }
@@ -201,12 +206,12 @@ const RKMemoryRegion* RKMemoryObject::_canonicalRegion() const {
 
 const std::string& RKMemoryObject::name() const {
     const RKMemoryRegion* canonical = _canonicalRegion();
-    return canonical ? canonical->name : kNoName;
+    return canonical ? canonical->name.str() : kNoName;
 }
 
 const std::string& RKMemoryObject::detailedName() const {
     const RKMemoryRegion* canonical = _canonicalRegion();
-    return canonical ? canonical->detailedName : kNoName;
+    return canonical ? canonical->detailedName.str() : kNoName;
 }
 
 std::string RKMemoryObject::fullName() const {

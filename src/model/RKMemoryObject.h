@@ -17,6 +17,7 @@
 #include <optional>
 #include <string>
 
+#include "model/RKObjectRegions.h"
 #include "model/RKRangeList.h"
 #include "process/RKProcess.h"
 
@@ -61,7 +62,7 @@ public:
     pid_t ownerPid() const { return ownerPid_; }           // -1: no owner
     void setOwnerPid(pid_t pid) { ownerPid_ = pid; }
 
-    const RKRegionList& memoryRegions() const { return memoryRegions_; }
+    const RKObjectRegions& memoryRegions() const { return memoryRegions_; }
     const RKProcessRegionMap* processMemoryRegions() const { return processMemoryRegions_.get(); }
 
     // Names come from the canonical region; empty for an object without regions.
@@ -81,21 +82,23 @@ private:
     void _mergeSoleRegion(RKRangeList& into);
     void _addToProcessViews(const std::shared_ptr<RKMemoryRegion>& region, pid_t pid);
 
+    // One object per mapping at most: widest fields first, counts and indexes in 32 bits.
     uint64_t totalDirtySize_ = 0;
     uint64_t totalCleanSize_ = 0;
     uint64_t totalSwappedSize_ = 0;
     uint64_t totalReclaimableSize_ = 0;
-    bool accurateSizes_ = false;
-    pid_t ownerPid_ = -1;
     uint64_t totalWiredSize_ = 0;
-    RKRegionList memoryRegions_;
+    RKObjectRegions memoryRegions_;
     // Per process, while two or more have regions since the views began.
     std::unique_ptr<RKProcessRegionMap> processMemoryRegions_;
-    static constexpr size_t kNoViews = SIZE_MAX;
-    size_t viewsFrom_ = kNoViews;  // in memoryRegions_, until finalized
-    pid_t viewsPid_ = 0;           // of the regions since then, while there is no map
     std::unique_ptr<RKRangeList> rangeList_;
-    RKMemoryRegion* soleRegion_ = nullptr;  // the one region with pages while there is no range list
-    uint64_t soleRegionPageSize_ = 0;
-    bool containsFakeRegion_ = false;
+    pid_t ownerPid_ = -1;
+    static constexpr uint32_t kNone = UINT32_MAX;
+    uint32_t viewsFrom_ = kNone;  // in memoryRegions_, until finalized
+    pid_t viewsPid_ = 0;          // of the regions since then, while there is no map
+    // In memoryRegions_: the one region with pages while there is no range list.
+    uint32_t soleRegion_ = kNone;
+    uint32_t soleRegionPageSize_ = 0;
+    bool accurateSizes_ : 1 = false;
+    bool containsFakeRegion_ : 1 = false;
 };

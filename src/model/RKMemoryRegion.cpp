@@ -4,6 +4,9 @@
 #include "model/RKRangeList.h"
 #include "platform/RKKernelTypes.h"
 
+// One per mapping: a field added in the wrong place costs a padding hole per mapping.
+static_assert(sizeof(void*) != 8 || sizeof(RKMemoryRegion) <= 112);
+
 RKMemoryRegion::RKMemoryRegion() = default;
 RKMemoryRegion::~RKMemoryRegion() = default;
 

@@ -12,6 +12,7 @@
 #include <optional>
 #include <string>
 
+#include "model/RKInternedString.h"
 #include "model/RKMemoryTotal.h"
 
 class RKMemoryObject;
@@ -38,17 +39,8 @@ public:
     RKMemoryRegion(const RKMemoryRegion&) = delete;
     RKMemoryRegion& operator=(const RKMemoryRegion&) = delete;
 
-    bool wired = false;
-    bool inSharedCache = false;
-    bool unusedSharedCacheRegion = false;
-    bool ownedExclusivelyByParentProcess = false;
-    bool verbose = false;  // listed only in verbose output (reserved ranges)
-    uint8_t segment = RKSegmentUnset;
-    uint8_t share_mode = 0;  // the kernel's SM_* code of the mapping
-    uint32_t user_tag = 0;
-    std::string name;
-    std::string detailedName;  // empty when there is no detail
-    uint64_t offset = 0;       // of `start` inside the VM object; range lists use this space
+    // Widest fields first, so that the record has no padding: there is one per mapping.
+    uint64_t offset = 0;  // of `start` inside the VM object; range lists use this space
     uint64_t start = 0;
     uint64_t size = 0;
     uint64_t dirtySize = 0;
@@ -56,6 +48,16 @@ public:
     uint64_t swappedSize = 0;
     uint64_t cleanNonSpecSize = 0;
     uint64_t object_id = 0;  // 0: no VM object behind the range
+    RKInternedString name;
+    RKInternedString detailedName;  // empty when there is no detail
+    uint32_t user_tag = 0;
+    uint8_t segment = RKSegmentUnset;
+    uint8_t share_mode = 0;  // the kernel's SM_* code of the mapping
+    bool wired : 1 = false;
+    bool inSharedCache : 1 = false;
+    bool unusedSharedCacheRegion : 1 = false;
+    bool ownedExclusivelyByParentProcess : 1 = false;
+    bool verbose : 1 = false;  // listed only in verbose output (reserved ranges)
 
     // ---- Derived values ----
     // start + size; memory without an address ends at RKRegionNoAddress too (no wrap-around).
@@ -92,6 +94,8 @@ public:
     static std::optional<std::string> vmLedgerNameForTag(uint64_t tag);
 
 private:
+    // Weak: the object holds its regions. A region whose object was released (after a report)
+    // answers null, which the analysis relies on.
     std::weak_ptr<RKMemoryObject> memoryObject_;
     std::unique_ptr<RKRangeList> subrangeList_;
 };
