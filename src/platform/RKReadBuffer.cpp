@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstring>
 #include <utility>
 
 #include "platform/RKUniqueFd.h"
@@ -12,6 +13,30 @@
 namespace {
 
 constexpr size_t kFirstCapacity = 256 << 10;
+
+#if defined(__SANITIZE_THREAD__)
+constexpr bool kThreadSanitizer = true;
+#elif defined(__has_feature)
+#if __has_feature(thread_sanitizer)
+constexpr bool kThreadSanitizer = true;
+#else
+constexpr bool kThreadSanitizer = false;
+#endif
+#else
+constexpr bool kThreadSanitizer = false;
+#endif
+
+// ThreadSanitizer does not follow mremap: the moved pages keep the shadow of whatever was mapped
+// at their new address before, often another worker's buffer, and it reports races that are not
+// there. Under it the buffer grows by a new mapping and a copy, which it does follow.
+void* moveToLarger(char* data, size_t capacity, size_t larger) {
+    if (!kThreadSanitizer) return ::mremap(data, capacity, larger, MREMAP_MAYMOVE);
+    void* fresh = ::mmap(nullptr, larger, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+    if (fresh == MAP_FAILED) return MAP_FAILED;
+    std::memcpy(fresh, data, capacity);
+    ::munmap(data, capacity);
+    return fresh;
+}
 
 }  // namespace
 
@@ -40,7 +65,7 @@ bool RKReadBuffer::grow() {
         data_ = static_cast<char*>(fresh), capacity_ = kFirstCapacity;
         return true;
     }
-    void* moved = ::mremap(data_, capacity_, capacity_ * 2, MREMAP_MAYMOVE);
+    void* moved = moveToLarger(data_, capacity_, capacity_ * 2);
     if (moved == MAP_FAILED) return false;
     data_ = static_cast<char*>(moved), capacity_ *= 2;
     return true;
