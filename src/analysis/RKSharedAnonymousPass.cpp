@@ -180,7 +180,12 @@ private:
                 added[object.members[m]].push_back(object.regions[m].finish(processes_[object.members[m]]->pageSize()));
         for (size_t p = 0; p < processes_.size(); p++) {
             if (added[p].empty()) continue;
-            RKRegionList regions = processes_[p]->memoryRegions().value_or(RKRegionList{});
+            // Sized exactly: a list grown by insertion would keep up to twice its regions' room.
+            static const RKRegionList kNone;
+            const RKRegionList& had = processes_[p]->memoryRegions() ? *processes_[p]->memoryRegions() : kNone;
+            RKRegionList regions;
+            regions.reserve(had.size() + added[p].size());
+            regions.insert(regions.end(), had.begin(), had.end());
             regions.insert(regions.end(), added[p].begin(), added[p].end());
             processes_[p]->setMemoryRegions(std::move(regions));
         }
