@@ -55,7 +55,10 @@ public:
     void printSpanlistLikeOutputForProcesses(const RKProcessList& processes);
 
     // ---- Steps of the analysis, public so that each can be checked on its own ----
-    void _addProcess(const RKProcess& process);
+    // Objects of ids that no other process can meet, process by process in parallel.
+    void _identifyPrivateObjects();
+    // The other regions of processes_[index], through the identity maps, in process order.
+    void _addProcess(size_t index);
     // Anonymous pages shared across fork or by KSM, counted once (RKSharedAnonymousPass.cpp).
     void _attributeSharedAnonymousPages();
     void finalizeObjects();
@@ -100,6 +103,15 @@ private:
     // Analysis state: the identity maps live from analyzeData until the groups are built.
     RKPidToMemspreadMap pidToMemspread_;
     std::unique_ptr<RKIdentityMaps> identityMaps_;
+
+    std::vector<bool> _privateIdsAlone() const;
+    // What identity found in processes_[index] alone; null before analysis or once it is over.
+    const RKProcessIdentity* _identityOf(size_t index) const {
+        return identityMaps_ && index < identityMaps_->byProcess.size() ? &identityMaps_->byProcess[index] : nullptr;
+    }
+    static bool _addRegionToObject(const std::shared_ptr<RKMemoryObject>& object,
+                                   const std::shared_ptr<RKMemoryRegion>& region, const RKProcess& process,
+                                   bool breakDown);
 
     struct ReportState;
     void _printReportedProcess(const std::shared_ptr<RKProcess>& process, const RKProcessToGroupsMap& groups,
