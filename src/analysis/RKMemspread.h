@@ -51,6 +51,17 @@ public:
     void analyzeData();
     void addOutputFormatter(std::shared_ptr<RKOutputFormatter> formatter);
     void printOutputVerbose(bool verbose, bool summarize);
+    // What a report leaves: the processes with their regions, and the groups that hold the
+    // memory objects.
+    struct ReportRemains {
+        RKProcessList processes;
+        RKProcessToGroupsMap groups;
+    };
+    // For a run that exits after its report: printOutputVerbose then leaves the groups to
+    // takeReportRemains rather than releasing them, object by object, before it returns.
+    void setKeepsReportRemains(bool keep) { keepsReportRemains_ = keep; }
+    // After printOutputVerbose; the analysis holds nothing of the report afterwards.
+    ReportRemains takeReportRemains();
     // The verbose region listing, on the formatters that offer it.
     void printSpanlistLikeOutputForProcesses(const RKProcessList& processes);
 
@@ -98,6 +109,8 @@ private:
     std::atomic<bool> earlyExit_{false};
     uint32_t qualityOfService_ = QOS_CLASS_UTILITY;
     bool measuresWholeSystem_ = false;
+    bool keepsReportRemains_ = false;
+    RKProcessToGroupsMap reportGroups_;  // kept for takeReportRemains
     std::optional<RKTime> gatherStartTime_;
     std::optional<RKTime> gatherEndTime_;
     // Analysis state: the identity maps live from analyzeData until the groups are built.

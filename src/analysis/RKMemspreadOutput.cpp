@@ -54,7 +54,7 @@ void RKMemspread::printOutputVerbose(bool verbose, bool summarize) {
     }
     if (verbose) printSpanlistLikeOutputForProcesses(reported);
 
-    const RKProcessToGroupsMap groups = _generateProcessToProcessGroups();
+    RKProcessToGroupsMap groups = _generateProcessToProcessGroups();
     // From here on the groups, categories and views hold the memory objects.
     identityMaps_.reset();
 
@@ -80,6 +80,14 @@ void RKMemspread::printOutputVerbose(bool verbose, bool summarize) {
         formatter->printGlobalAuxData(report.globalAuxData);
         formatter->endAtTime(timeOrZero(gatherEndTime_));
     }
+    if (keepsReportRemains_) reportGroups_ = std::move(groups);
+}
+
+RKMemspread::ReportRemains RKMemspread::takeReportRemains() {
+    ReportRemains remains{std::move(processes_), std::move(reportGroups_)};
+    processes_.clear(), reportGroups_.clear();
+    pidToMemspread_.clear();
+    return remains;
 }
 
 void RKMemspread::_addSystemMemory(ReportState& report) const {
