@@ -131,6 +131,8 @@ private:
                                bool summarize, ReportState& report);
     void _printProcessHeader(RKProcess& process, bool hasErrors);
     void _addSystemMemory(ReportState& report) const;
+    void _computePrivateGroupCategories(const RKProcessList& reported, const RKProcessToGroupsMap& groups,
+                                        bool summarize);
     void _printProcessGroups(RKProcess& process, const RKProcessGroupList* groups, bool summarize);
     void _printGroup(RKProcessGroup& group, RKProcess& process, bool summarize);
 };
