@@ -91,7 +91,8 @@ public:
     // Every object reached from a shown process, once and whole.
     RKCategoryMap _categoriesForAllProcessesShouldSummarize(bool summarize) const;
     static void _totalForCategories(const RKCategoryMap& categories, RKMemoryTotal* outTotal);
-    RKProcessToGroupsMap _generateProcessToProcessGroups() const;
+    // Ends the analysis state: the identity maps are released once the groups hold the objects.
+    RKProcessToGroupsMap _generateProcessToProcessGroups();
 
     const RKProcessList& processes() const { return processes_; }
     uint32_t qualityOfService() const { return qualityOfService_; }

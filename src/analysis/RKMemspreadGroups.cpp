@@ -22,7 +22,7 @@ bool hiddenProcessCounts(const RKMemoryObject& object, const std::unordered_set<
 
 }  // namespace
 
-RKProcessToGroupsMap RKMemspread::_generateProcessToProcessGroups() const {
+RKProcessToGroupsMap RKMemspread::_generateProcessToProcessGroups() {
     std::unordered_set<pid_t> shownPids;
     size_t regionCount = 0, mappedCount = 0;
     for (size_t p = 0; p < processes_.size(); p++) {
@@ -74,6 +74,8 @@ RKProcessToGroupsMap RKMemspread::_generateProcessToProcessGroups() const {
         });
     }
     decltype(indexOf)().swap(indexOf);  // its memory, before the groups are made
+    // From here on `objects`, then the groups, hold the memory objects.
+    identityMaps_.reset();
 
     // One group a distinct set of mappers, made when its first object is met.
     std::vector<std::shared_ptr<RKProcessGroup>> groupOf(sets.count());

@@ -60,9 +60,8 @@ void RKMemspread::printOutputVerbose(bool verbose, bool summarize) {
     }
     if (verbose) printSpanlistLikeOutputForProcesses(reported);
 
-    RKProcessToGroupsMap groups = _generateProcessToProcessGroups();
     // From here on the groups, categories and views hold the memory objects.
-    identityMaps_.reset();
+    RKProcessToGroupsMap groups = _generateProcessToProcessGroups();
 
     _computePrivateGroupCategories(reported, groups, summarize);
     ReportState report;
