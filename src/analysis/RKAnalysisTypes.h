@@ -28,6 +28,15 @@ using RKMemoryObjectList = std::vector<std::shared_ptr<RKMemoryObject>>;
 inline constexpr uint64_t RKNoIdentityKey = 0;
 inline constexpr uint64_t RKInvalidIdentityKey = 0xFFFFFFFFFFFFFFFFull;
 
+// What identity found in one process alone (RKMemspreadAnalysis.cpp).
+struct RKProcessIdentity {
+    // The objects of its private ids: no other process can map them, so they are found within
+    // the process and need no entry in the maps below.
+    RKMemoryObjectList privateObjects;
+    std::vector<uint32_t> mappedRegions;  // indices of the regions whose objects the maps find
+    bool privateIdsRepeat = false;        // an object of privateObjects has two regions or more
+};
+
 // The maps own the memory objects from analysis until the sharing groups are built.
 struct RKIdentityMaps {
     explicit RKIdentityMaps(size_t processCount);
@@ -41,6 +50,7 @@ struct RKIdentityMaps {
     // Objects that more than one process owns (a memfd whose descriptor several hold): no one
     // process owns them, so they are shared memory of their holders.
     std::unordered_set<RKMemoryObject*> ownedBySeveral;
+    std::vector<RKProcessIdentity> byProcess;  // in the order of the analysis's processes
 };
 
 using RKPidToMemspreadMap = std::unordered_map<pid_t, uint64_t>;

@@ -51,11 +51,25 @@ public:
     void analyzeData();
     void addOutputFormatter(std::shared_ptr<RKOutputFormatter> formatter);
     void printOutputVerbose(bool verbose, bool summarize);
+    // What a report leaves: the processes with their regions, and the groups that hold the
+    // memory objects.
+    struct ReportRemains {
+        RKProcessList processes;
+        RKProcessToGroupsMap groups;
+    };
+    // For a run that exits after its report: printOutputVerbose then leaves the groups to
+    // takeReportRemains rather than releasing them, object by object, before it returns.
+    void setKeepsReportRemains(bool keep) { keepsReportRemains_ = keep; }
+    // After printOutputVerbose; the analysis holds nothing of the report afterwards.
+    ReportRemains takeReportRemains();
     // The verbose region listing, on the formatters that offer it.
     void printSpanlistLikeOutputForProcesses(const RKProcessList& processes);
 
     // ---- Steps of the analysis, public so that each can be checked on its own ----
-    void _addProcess(const RKProcess& process);
+    // Objects of ids that no other process can meet, process by process in parallel.
+    void _identifyPrivateObjects();
+    // The other regions of processes_[index], through the identity maps, in process order.
+    void _addProcess(size_t index);
     // Anonymous pages shared across fork or by KSM, counted once (RKSharedAnonymousPass.cpp).
     void _attributeSharedAnonymousPages();
     void finalizeObjects();
@@ -77,7 +91,8 @@ public:
     // Every object reached from a shown process, once and whole.
     RKCategoryMap _categoriesForAllProcessesShouldSummarize(bool summarize) const;
     static void _totalForCategories(const RKCategoryMap& categories, RKMemoryTotal* outTotal);
-    RKProcessToGroupsMap _generateProcessToProcessGroups() const;
+    // Ends the analysis state: the identity maps are released once the groups hold the objects.
+    RKProcessToGroupsMap _generateProcessToProcessGroups();
 
     const RKProcessList& processes() const { return processes_; }
     uint32_t qualityOfService() const { return qualityOfService_; }
@@ -95,17 +110,30 @@ private:
     std::atomic<bool> earlyExit_{false};
     uint32_t qualityOfService_ = QOS_CLASS_UTILITY;
     bool measuresWholeSystem_ = false;
+    bool keepsReportRemains_ = false;
+    RKProcessToGroupsMap reportGroups_;  // kept for takeReportRemains
     std::optional<RKTime> gatherStartTime_;
     std::optional<RKTime> gatherEndTime_;
     // Analysis state: the identity maps live from analyzeData until the groups are built.
     RKPidToMemspreadMap pidToMemspread_;
     std::unique_ptr<RKIdentityMaps> identityMaps_;
 
+    std::vector<bool> _privateIdsAlone() const;
+    // What identity found in processes_[index] alone; null before analysis or once it is over.
+    const RKProcessIdentity* _identityOf(size_t index) const {
+        return identityMaps_ && index < identityMaps_->byProcess.size() ? &identityMaps_->byProcess[index] : nullptr;
+    }
+    static bool _addRegionToObject(const std::shared_ptr<RKMemoryObject>& object,
+                                   const std::shared_ptr<RKMemoryRegion>& region, const RKProcess& process,
+                                   bool breakDown);
+
     struct ReportState;
     void _printReportedProcess(const std::shared_ptr<RKProcess>& process, const RKProcessToGroupsMap& groups,
                                bool summarize, ReportState& report);
     void _printProcessHeader(RKProcess& process, bool hasErrors);
     void _addSystemMemory(ReportState& report) const;
+    void _computePrivateGroupCategories(const RKProcessList& reported, const RKProcessToGroupsMap& groups,
+                                        bool summarize);
     void _printProcessGroups(RKProcess& process, const RKProcessGroupList* groups, bool summarize);
     void _printGroup(RKProcessGroup& group, RKProcess& process, bool summarize);
 };

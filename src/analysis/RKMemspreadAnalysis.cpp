@@ -1,11 +1,14 @@
 // Object identity across processes, per-process memspread numbers and categories.
 #include <algorithm>
+#include <bit>
 
 #include "analysis/RKMemspread.h"
 #include "analysis/RKPointerSet.h"
+#include "analysis/RKWorkerPool.h"
 #include "model/RKMemoryCategory.h"
 #include "model/RKMemoryObject.h"
 #include "model/RKMemoryRegion.h"
+#include "platform/RKLinuxVmaClassifier.h"
 
 namespace {
 
@@ -42,6 +45,36 @@ KeyedMap identityOf(const RKMemoryRegion& region, const RKProcess& process, RKId
         default: return {region.object_id, &maps.memoryObjects};
     }
 }
+
+// The private ids of one process, each with its object's index in the process's list: open
+// addressing in one array sized for all the process's regions, as most of them have one.
+class PrivateIdTable {
+public:
+    static constexpr uint32_t kNew = UINT32_MAX;
+
+    explicit PrivateIdTable(size_t regions) : slots_(std::bit_ceil(std::max<size_t>(regions * 2, 16))) {}
+
+    // The object index of `id` in `map`, or kNew after recording `next` for it.
+    uint32_t findOrAdd(uint64_t id, const RKIdentityMap* map, uint32_t next) {
+        const size_t mask = slots_.size() - 1;
+        for (size_t at = static_cast<size_t>(id * 0x9E3779B97F4A7C15ull >> 20) & mask;; at = (at + 1) & mask) {
+            Slot& slot = slots_[at];
+            if (slot.id == 0) {
+                slot = {id, map, next};
+                return kNew;
+            }
+            if (slot.id == id && slot.map == map) return slot.object;
+        }
+    }
+
+private:
+    struct Slot {
+        uint64_t id = 0;  // private ids are never 0
+        const RKIdentityMap* map = nullptr;
+        uint32_t object = 0;
+    };
+    std::vector<Slot> slots_;
+};
 
 // The category map entries of objects, made on first use. Objects met one after another mostly
 // share their category (a process's regions of one kind): the last entry is kept, and the map
@@ -83,19 +116,89 @@ void RKMemspread::analyzeData() {
     pidToMemspread_.clear();
     identityMaps_ = std::make_unique<RKIdentityMaps>(processes_.size());
     _attributeSharedAnonymousPages();
-    for (const auto& process : processes_) _addProcess(*process);
+    _identifyPrivateObjects();
+    for (size_t p = 0; p < processes_.size(); p++) _addProcess(p);
     for (RKMemoryObject* object : identityMaps_->ownedBySeveral) object->setOwnerPid(-1);
     finalizeObjects();
     _buildProcessToMemspreadMap();
 }
 
-void RKMemspread::_addProcess(const RKProcess& process) {
+// Private ids of a pid whose bits another process carries too (two snapshots of one process)
+// may meet across processes: those processes find every object through the maps.
+std::vector<bool> RKMemspread::_privateIdsAlone() const {
+    std::vector<uint32_t> bits;
+    bits.reserve(processes_.size());
+    for (const auto& process : processes_) bits.push_back(RKPrivateObjectIdPidBits(process->pid()));
+    std::vector<uint32_t> sorted = bits;
+    std::sort(sorted.begin(), sorted.end());
+    std::vector<bool> alone(processes_.size());
+    for (size_t p = 0; p < bits.size(); p++) {
+        auto [first, last] = std::equal_range(sorted.begin(), sorted.end(), bits[p]);
+        alone[p] = last - first == 1;
+    }
+    return alone;
+}
+
+void RKMemspread::_identifyPrivateObjects() {
+    RKIdentityMaps& maps = *identityMaps_;
+    maps.byProcess.assign(processes_.size(), {});
+    const std::vector<bool> alone = _privateIdsAlone();
+    const bool breakDown = breakDownPhysMemspread();  // read once here: workers only read the cache
+    // Each process's objects are its own: the processes are identified side by side.
+    RKWorkerPoolOptions options;
+    options.threads = RKOnlineCpuCount();
+    RKParallelApply(processes_.size(), options, [&](size_t p) {
+        const RKProcess& process = *processes_[p];
+        if (!process.memoryRegions()) return;
+        const RKRegionList& regions = *process.memoryRegions();
+        RKProcessIdentity& own = maps.byProcess[p];
+        PrivateIdTable table(alone[p] ? regions.size() : 0);
+        for (uint32_t i = 0; i < regions.size(); i++) {
+            const RKMemoryRegion& region = *regions[i];
+            auto [key, map] = identityOf(region, process, maps);
+            if (!alone[p] || region.inSharedCache || !RKIsPrivateObjectIdOf(key, process.pid())) {
+                own.mappedRegions.push_back(i);
+                continue;
+            }
+            uint32_t index = table.findOrAdd(key, map, static_cast<uint32_t>(own.privateObjects.size()));
+            if (index == PrivateIdTable::kNew) {
+                index = static_cast<uint32_t>(own.privateObjects.size());
+                own.privateObjects.push_back(std::make_shared<RKMemoryObject>());
+            } else {
+                own.privateIdsRepeat = true;
+            }
+            _addRegionToObject(own.privateObjects[index], regions[i], process, breakDown);
+        }
+        for (const auto& object : own.privateObjects) object->finalize();
+    });
+}
+
+// Returns whether the object had another owner already.
+bool RKMemspread::_addRegionToObject(const std::shared_ptr<RKMemoryObject>& object,
+                                     const std::shared_ptr<RKMemoryRegion>& region, const RKProcess& process,
+                                     bool breakDown) {
+    if (isSharingAnalysisDisabled()) {
+        object->addRegion(region, process.pageSize());
+    } else {
+        object->addRegion(region, process);
+    }
+    bool ownedBySeveral = false;
+    if (breakDown && region->ownedExclusivelyByParentProcess) {
+        ownedBySeveral = object->ownerPid() != -1 && object->ownerPid() != process.pid();
+        object->setOwnerPid(process.pid());
+    }
+    region->setMemoryObject(object);
+    return ownedBySeveral;
+}
+
+void RKMemspread::_addProcess(size_t index) {
+    const RKProcess& process = *processes_[index];
     if (!process.memoryRegions()) return;  // not gathered (cancelled)
     const bool breakDown = breakDownPhysMemspread();
-    const bool sharingDisabled = isSharingAnalysisDisabled();
     RKIdentityMaps& maps = *identityMaps_;
-
-    for (const auto& region : *process.memoryRegions()) {
+    const RKRegionList& regions = *process.memoryRegions();
+    for (uint32_t i : maps.byProcess[index].mappedRegions) {
+        const std::shared_ptr<RKMemoryRegion>& region = regions[i];
         auto [key, map] = identityOf(*region, process, maps);
         std::shared_ptr<RKMemoryObject> object;
         if (key == RKNoIdentityKey || key == RKInvalidIdentityKey) {
@@ -106,19 +209,11 @@ void RKMemspread::_addProcess(const RKProcess& process) {
             if (!slot) slot = std::make_shared<RKMemoryObject>();
             object = slot;
         }
-        if (sharingDisabled) {
-            object->addRegion(region, process.pageSize());
-        } else {
-            object->addRegion(region, process);
-        }
-        if (breakDown && region->ownedExclusivelyByParentProcess) {
-            if (object->ownerPid() != -1 && object->ownerPid() != process.pid()) maps.ownedBySeveral.insert(object.get());
-            object->setOwnerPid(process.pid());
-        }
-        region->setMemoryObject(object);
+        if (_addRegionToObject(object, region, process, breakDown)) maps.ownedBySeveral.insert(object.get());
     }
 }
 
+// The objects of the maps; private objects were finalized where they were made.
 void RKMemspread::finalizeObjects() {
     if (!identityMaps_) return;
     RKIdentityMaps& maps = *identityMaps_;
@@ -164,9 +259,15 @@ uint64_t RKMemspread::_calculateMemspreadForProcess(const RKProcess& process) co
 
 void RKMemspread::_buildProcessToMemspreadMap() {
     pidToMemspread_.clear();
-    for (const auto& process : processes_) {
-        if (process->hiddenFromDisplay()) continue;
-        pidToMemspread_[process->pid()] = _calculateMemspreadForProcess(*process);
+    std::vector<uint64_t> memspread(processes_.size());
+    RKWorkerPoolOptions options;
+    options.threads = RKOnlineCpuCount();
+    RKParallelApply(processes_.size(), options, [&](size_t p) {
+        if (!processes_[p]->hiddenFromDisplay()) memspread[p] = _calculateMemspreadForProcess(*processes_[p]);
+    });
+    pidToMemspread_.reserve(processes_.size());
+    for (size_t p = 0; p < processes_.size(); p++) {
+        if (!processes_[p]->hiddenFromDisplay()) pidToMemspread_[processes_[p]->pid()] = memspread[p];
     }
 }
 

@@ -22,12 +22,16 @@ bool hiddenProcessCounts(const RKMemoryObject& object, const std::unordered_set<
 
 }  // namespace
 
-RKProcessToGroupsMap RKMemspread::_generateProcessToProcessGroups() const {
+RKProcessToGroupsMap RKMemspread::_generateProcessToProcessGroups() {
     std::unordered_set<pid_t> shownPids;
-    size_t regionCount = 0;
-    for (const auto& process : processes_) {
-        if (!process->hiddenFromDisplay()) shownPids.insert(process->pid());
-        if (process->memoryRegions()) regionCount += process->memoryRegions()->size();
+    size_t regionCount = 0, mappedCount = 0;
+    for (size_t p = 0; p < processes_.size(); p++) {
+        const RKProcess& process = *processes_[p];
+        if (!process.hiddenFromDisplay()) shownPids.insert(process.pid());
+        if (!process.memoryRegions()) continue;
+        regionCount += process.memoryRegions()->size();
+        const RKProcessIdentity* identity = _identityOf(p);
+        mappedCount += identity ? identity->mappedRegions.size() : process.memoryRegions()->size();
     }
 
     // Each object's mappers as a set of process numbers, objects in the order they are first
@@ -36,17 +40,33 @@ RKProcessToGroupsMap RKMemspread::_generateProcessToProcessGroups() const {
     std::vector<std::shared_ptr<RKMemoryObject>> objects;
     std::vector<uint32_t> mappersOf;
     std::unordered_map<const RKMemoryObject*, uint32_t> indexOf;
-    objects.reserve(regionCount), mappersOf.reserve(regionCount), indexOf.reserve(regionCount);
+    objects.reserve(regionCount), mappersOf.reserve(regionCount), indexOf.reserve(mappedCount);
     for (uint32_t p = 0; p < processes_.size(); p++) {
         const RKProcess& process = *processes_[p];
         if (!process.memoryRegions()) continue;
         const bool hidden = process.hiddenFromDisplay();
+        // A private object is this process's alone and, unless two of its regions share it, met
+        // once here: it needs no entry in indexOf. The other regions are listed, ascending.
+        const RKProcessIdentity* identity = _identityOf(p);
+        const bool privateMetOnce = identity && !identity->privateIdsRepeat;
+        size_t nextMapped = 0;
         std::span<const std::shared_ptr<RKMemoryRegion>> regions(*process.memoryRegions());
         rk_enumerateObjectsWithBatchSize(regions, kRegionBatchSize, [&](const auto* batch, size_t count) {
             for (size_t i = 0; i < count; i++) {
+                bool metOnce = false;
+                if (privateMetOnce) {
+                    const auto index = static_cast<uint32_t>(batch + i - regions.data());
+                    const auto& mapped = identity->mappedRegions;
+                    metOnce = nextMapped == mapped.size() || mapped[nextMapped] != index;
+                    if (!metOnce) nextMapped++;
+                }
                 std::shared_ptr<RKMemoryObject> object = batch[i]->memoryObject();
                 if (!object) continue;  // never analyzed, or released after a previous report
                 if (hidden && !hiddenProcessCounts(*object, shownPids)) continue;
+                if (metOnce) {
+                    objects.push_back(std::move(object)), mappersOf.push_back(sets.with(RKProcessSetTrie::kEmpty, p));
+                    continue;
+                }
                 auto [slot, added] = indexOf.try_emplace(object.get(), static_cast<uint32_t>(objects.size()));
                 if (added) objects.push_back(std::move(object)), mappersOf.push_back(RKProcessSetTrie::kEmpty);
                 mappersOf[slot->second] = sets.with(mappersOf[slot->second], p);
@@ -54,6 +74,8 @@ RKProcessToGroupsMap RKMemspread::_generateProcessToProcessGroups() const {
         });
     }
     decltype(indexOf)().swap(indexOf);  // its memory, before the groups are made
+    // From here on `objects`, then the groups, hold the memory objects.
+    identityMaps_.reset();
 
     // One group a distinct set of mappers, made when its first object is met.
     std::vector<std::shared_ptr<RKProcessGroup>> groupOf(sets.count());
@@ -66,7 +88,7 @@ RKProcessToGroupsMap RKMemspread::_generateProcessToProcessGroups() const {
             group = mappers.immutableCopy();
             groupsInOrder.push_back(group);
         }
-        group->addObject(objects[i]);
+        group->addObject(std::move(objects[i]));
     }
 
     RKProcessToGroupsMap result;

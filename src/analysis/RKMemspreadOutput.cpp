@@ -1,7 +1,13 @@
 // Driving the formatters through one report. Every step calls the formatters in the order they
 // were added, the formatter loop being the innermost loop.
 #include "analysis/RKMemspread.h"
+
+#include <unordered_map>
+#include <utility>
+#include <vector>
+
 #include "analysis/RKSystemMemory.h"
+#include "analysis/RKWorkerPool.h"
 #include "model/RKAuxData.h"
 #include "model/RKMemoryCategory.h"
 #include "model/RKMemoryObject.h"
@@ -54,10 +60,10 @@ void RKMemspread::printOutputVerbose(bool verbose, bool summarize) {
     }
     if (verbose) printSpanlistLikeOutputForProcesses(reported);
 
-    const RKProcessToGroupsMap groups = _generateProcessToProcessGroups();
     // From here on the groups, categories and views hold the memory objects.
-    identityMaps_.reset();
+    RKProcessToGroupsMap groups = _generateProcessToProcessGroups();
 
+    _computePrivateGroupCategories(reported, groups, summarize);
     ReportState report;
     for (const auto& process : reported) _printReportedProcess(process, groups, summarize, report);
     if (measuresWholeSystem_) _addSystemMemory(report);
@@ -80,6 +86,36 @@ void RKMemspread::printOutputVerbose(bool verbose, bool summarize) {
         formatter->printGlobalAuxData(report.globalAuxData);
         formatter->endAtTime(timeOrZero(gatherEndTime_));
     }
+    if (keepsReportRemains_) reportGroups_ = std::move(groups);
+}
+
+RKMemspread::ReportRemains RKMemspread::takeReportRemains() {
+    ReportRemains remains{std::move(processes_), std::move(reportGroups_)};
+    processes_.clear(), reportGroups_.clear();
+    pidToMemspread_.clear();
+    return remains;
+}
+
+// Most objects are in the processes' private groups, whose categories depend on nothing else:
+// they are computed side by side before the report is written in order, and reach _printGroup
+// through the group's cache. A group listed twice (processes of one pid) is left to _printGroup.
+void RKMemspread::_computePrivateGroupCategories(const RKProcessList& reported, const RKProcessToGroupsMap& groups,
+                                                 bool summarize) {
+    std::vector<std::pair<RKProcessGroup*, const RKProcess*>> work;
+    std::unordered_map<const RKProcessGroup*, uint32_t> listings;
+    for (const auto& process : reported) {
+        auto list = groups.find(process->pid());
+        if (list == groups.end() || list->second.front()->count() != 1) continue;
+        listings[list->second.front().get()]++;
+        if (process->errors().empty()) work.emplace_back(list->second.front().get(), process.get());
+    }
+    std::erase_if(work, [&](const auto& item) { return listings[item.first] != 1; });
+    RKWorkerPoolOptions options;
+    options.threads = RKOnlineCpuCount();
+    RKParallelApply(work.size(), options, [&](size_t i) {
+        auto [group, process] = work[i];
+        group->attachCachedCategories(_categoriesForObjects(group->objects(), *process, nullptr, summarize), 1);
+    });
 }
 
 void RKMemspread::_addSystemMemory(ReportState& report) const {

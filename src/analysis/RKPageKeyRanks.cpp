@@ -8,22 +8,22 @@
 
 RKPageKeyRanks::Chunk& RKPageKeyRanks::chunk(uint64_t frame) {
     const uint64_t index = frame >> kChunkShift;
-    if (index != lastIndex_) {
+    if (index != addCursor_.index) {
         std::unique_ptr<Chunk>& slot = chunks_[index];
         if (!slot) slot = std::make_unique<Chunk>();
-        lastIndex_ = index, last_ = slot.get();
+        addCursor_ = {index, slot.get()};
     }
-    return *last_;
+    return *addCursor_.chunk;
 }
 
-const RKPageKeyRanks::Chunk& RKPageKeyRanks::chunk(uint64_t frame) const {
+const RKPageKeyRanks::Chunk& RKPageKeyRanks::chunk(uint64_t frame, Cursor& cursor) const {
     const uint64_t index = frame >> kChunkShift;
-    if (index != lastIndex_) {
+    if (index != cursor.index) {
         auto found = chunks_.find(index);
         RKAssert(found != chunks_.end(), "RKPageKeyRanks", "rank of a frame that was never added");
-        lastIndex_ = index, last_ = found->second.get();
+        cursor = {index, found->second.get()};
     }
-    return *last_;
+    return *cursor.chunk;
 }
 
 void RKPageKeyRanks::add(uint64_t key) {
@@ -58,10 +58,10 @@ void RKPageKeyRanks::seal() {
     count_ = total + swapped_.size();
 }
 
-uint32_t RKPageKeyRanks::rank(uint64_t key) const {
+uint32_t RKPageKeyRanks::rankFrom(uint64_t key, Cursor& cursor) const {
     if (key & RKSwappedPageKey)
         return frames_ + static_cast<uint32_t>(std::lower_bound(swapped_.begin(), swapped_.end(), key) - swapped_.begin());
-    const Chunk& c = chunk(key);
+    const Chunk& c = chunk(key, cursor);
     const uint64_t offset = key & ((uint64_t{1} << kChunkShift) - 1);
     const uint64_t below = c.bits[offset / 64] & ((uint64_t{1} << (offset % 64)) - 1);
     return c.base + c.before[offset / 64] + static_cast<uint32_t>(std::popcount(below));

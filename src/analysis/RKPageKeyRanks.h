@@ -11,15 +11,6 @@
 #include <vector>
 
 class RKPageKeyRanks {
-public:
-    void add(uint64_t key);
-    // After the last add, before the first rank.
-    void seal();
-    // The rank of a key that was added.
-    uint32_t rank(uint64_t key) const;
-    size_t size() const { return count_; }
-
-private:
     static constexpr unsigned kChunkShift = 15;
     static constexpr size_t kWords = (size_t{1} << kChunkShift) / 64;
     struct Chunk {
@@ -27,13 +18,39 @@ private:
         uint32_t before[kWords] = {};  // keys in the chunk's earlier words
         uint32_t base = 0;             // keys in earlier chunks
     };
+    // The chunk of the last key asked about: one process's keys come in ascending order.
+    struct Cursor {
+        uint64_t index = UINT64_MAX;
+        Chunk* chunk = nullptr;
+    };
+
+public:
+    void add(uint64_t key);
+    // After the last add, before the first rank.
+    void seal();
+    // The rank of a key that was added. One thread at a time: it keeps the last chunk it used.
+    uint32_t rank(uint64_t key) const { return rankFrom(key, rankCursor_); }
+    size_t size() const { return count_; }
+
+    // Ranks for one of several threads that rank keys at once, with a last chunk of its own.
+    class Reader {
+    public:
+        explicit Reader(const RKPageKeyRanks& ranks) : ranks_(ranks) {}
+        uint32_t rank(uint64_t key) { return ranks_.rankFrom(key, cursor_); }
+
+    private:
+        const RKPageKeyRanks& ranks_;
+        Cursor cursor_;
+    };
+
+private:
     Chunk& chunk(uint64_t frame);
-    const Chunk& chunk(uint64_t frame) const;
+    const Chunk& chunk(uint64_t frame, Cursor& cursor) const;
+    uint32_t rankFrom(uint64_t key, Cursor& cursor) const;
 
     std::unordered_map<uint64_t, std::unique_ptr<Chunk>> chunks_;
-    // The chunk of the last key asked about: one process's keys come in ascending order.
-    mutable uint64_t lastIndex_ = UINT64_MAX;
-    mutable Chunk* last_ = nullptr;
+    Cursor addCursor_;
+    mutable Cursor rankCursor_;
     std::vector<uint64_t> swapped_;
     uint32_t frames_ = 0;
     size_t count_ = 0;

@@ -8,7 +8,8 @@
 // one memory object whose identity is the set: every member gets a region without an address
 // whose subranges lie at the page's index in the set's ascending frame list (the same index in
 // every member), so the range list counts the page once and the sharing groups put it with
-// exactly that set. The regions the pages came from lose them.
+// exactly that set. The regions the pages came from lose them; that last walk runs one process
+// per worker thread, as each process writes only its own regions and member regions.
 //
 // Memory: the 12-byte page records the processes hold, and while the pass runs about 20 bytes a
 // distinct page; nothing per page after it. Time linear in page records.

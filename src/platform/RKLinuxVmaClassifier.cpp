@@ -257,12 +257,25 @@ uint64_t RKObjectIdForFile(uint8_t kindTag, uint64_t first, uint64_t second) {
     return h == ~0ull ? h ^ 2 : h;
 }
 
+namespace {
+
+constexpr uint64_t kPrivateFlag = 1ull << 62;
+constexpr unsigned kPrivatePidShift = 40;
+
+}  // namespace
+
+uint32_t RKPrivateObjectIdPidBits(pid_t pid) { return static_cast<uint32_t>(pid) & 0x3FFFFF; }
+
+bool RKIsPrivateObjectIdOf(uint64_t id, pid_t pid) {
+    return id >> 62 == 1 && (id >> kPrivatePidShift & 0x3FFFFF) == RKPrivateObjectIdPidBits(pid);
+}
+
 uint64_t RKPrivateObjectId(pid_t pid, uint64_t start, uint64_t pageSize) {
-    constexpr uint64_t kFlag = 1ull << 62;
+    constexpr uint64_t kFlag = kPrivateFlag;
     uint64_t page = start / (pageSize ? pageSize : 4096);
-    uint64_t pidBits = static_cast<uint64_t>(static_cast<uint32_t>(pid)) & 0x3FFFFF;
+    uint64_t pidBits = RKPrivateObjectIdPidBits(pid);
     // Exact for every address below 2^52 with 4 KiB pages; beyond, mixed (still never an
     // object id, 0 or all ones).
-    if (page < (1ull << 40)) return kFlag | pidBits << 40 | page;
+    if (page < (1ull << kPrivatePidShift)) return kFlag | pidBits << kPrivatePidShift | page;
     return kFlag | (mix64(pidBits ^ mix64(page)) & (kFlag - 1));
 }

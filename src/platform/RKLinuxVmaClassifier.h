@@ -63,6 +63,11 @@ std::string_view RKDetailForVma(const RKSmapsVma& vma, RKVmaKind kind);
 // the two never meet each other, 0 or all ones.
 uint64_t RKObjectIdForFile(uint8_t kindTag, uint64_t first, uint64_t second);
 uint64_t RKPrivateObjectId(pid_t pid, uint64_t start, uint64_t pageSize);
+// The bits of a pid that its private ids carry (the low 22).
+uint32_t RKPrivateObjectIdPidBits(pid_t pid);
+// Whether `id` is a private id carrying `pid`'s bits: only that process mints it, so it names
+// memory that no process with other pid bits can map.
+bool RKIsPrivateObjectIdOf(uint64_t id, pid_t pid);
 
 // Kind tags mixed into object ids so that equal inode numbers of different kinds never meet.
 inline constexpr uint8_t RKObjectKindFile = 1;

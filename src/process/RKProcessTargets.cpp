@@ -4,6 +4,7 @@
 #include <cstdlib>
 #include <unordered_map>
 #include <unordered_set>
+#include <vector>
 
 #include "platform/RKPlatform.h"
 #include "process/RKProcess.h"
@@ -21,21 +22,43 @@ std::optional<long long> leadingInteger(const std::string& text) {
     return value;
 }
 
-// Resolves one description against the list. Every process whose name equals it is taken by
-// name; the walk stops at a process whose pid equals its number, which is taken by number.
-bool resolveDescription(const std::string& description, const std::vector<RKBsdInfo>& list, RKPidNameMap& result) {
-    std::optional<long long> number = leadingInteger(description);
-    bool found = false;
-    for (const RKBsdInfo& info : list) {
-        if (RKProcess::_nameForBsdInfo(info) == description) {
-            result[info.pbi_pid] = description;
-            found = true;
-        } else if (number && *number == info.pbi_pid) {
-            result[info.pbi_pid] = std::nullopt;
-            return true;
+// The list's names, each read once (a name may take a readlink), and where each name and pid is.
+struct ListIndex {
+    explicit ListIndex(const std::vector<RKBsdInfo>& list) {
+        names.reserve(list.size());
+        for (size_t i = 0; i < list.size(); i++) {
+            names.push_back(RKProcess::_nameForBsdInfo(list[i]));
+            byName[names.back()].push_back(i);
+            byPid.try_emplace(list[i].pbi_pid, i);
         }
     }
-    return found;
+    std::vector<std::string> names;
+    std::unordered_map<std::string, std::vector<size_t>> byName;  // ascending
+    std::unordered_map<long long, size_t> byPid;
+};
+
+// Resolves one description against the list, as a walk of it would: every process whose name
+// equals it is taken by name; the walk stops at a process whose pid equals its number, which is
+// taken by number. Through the index, so that many descriptions cost no more than one walk each.
+bool resolveDescription(const std::string& description, const std::vector<RKBsdInfo>& list, const ListIndex& index,
+                        RKPidNameMap& result) {
+    std::optional<long long> number = leadingInteger(description);
+    size_t stop = list.size();
+    if (number) {
+        auto numbered = index.byPid.find(*number);
+        if (numbered != index.byPid.end() && index.names[numbered->second] != description) stop = numbered->second;
+    }
+    bool found = false;
+    if (auto named = index.byName.find(description); named != index.byName.end()) {
+        for (size_t i : named->second) {
+            if (i >= stop) break;
+            result[list[i].pbi_pid] = description;
+            found = true;
+        }
+    }
+    if (stop == list.size()) return found;
+    result[list[stop].pbi_pid] = std::nullopt;
+    return true;
 }
 
 }  // namespace
@@ -74,10 +97,11 @@ std::optional<RKPidNameMap> RKProcess::pidsForStringDescriptions(const std::vect
         if (errors) *errors = {"Unable to obtain system process list"};
         return std::nullopt;
     }
+    const ListIndex index(*list);
     RKPidNameMap result;
     std::vector<std::string> messages;
     for (const std::string& description : descriptions)
-        if (!resolveDescription(description, *list, result))
+        if (!resolveDescription(description, *list, index, result))
             messages.push_back("Unable to find pid for process matching '" + description + "'");
     if (errors && !messages.empty()) *errors = std::move(messages);
     return result;

@@ -2,6 +2,8 @@
 #include <gtest/gtest.h>
 
 #include "RKAnalysisTestSupport.h"
+#include "model/RKProcessGroup.h"
+#include "platform/RKLinuxVmaClassifier.h"
 
 // A maps [0, 8K) of object 7 dirty; B maps the same pages and 4K more further on. The pages both
 // map count once in the summary; each process is charged its own pages with the breakdown on and
@@ -40,6 +42,34 @@ TEST(RKObjectIdentityTest, KeysSeparateWhatMustNotMeet) {
     EXPECT_NE(objectOf(p2, 1), objectOf(p3, 0));
     // No object id, or an invalid one: one object per region.
     EXPECT_EQ(memspread.identityMaps()->uniqueMemoryObjects.size(), 3u);
+}
+
+// Private ids are found within their process, processes side by side: two regions of one id are
+// one object, listed once in the private group, and never another process's; processes whose
+// pids carry the same bits (two snapshots of one process) still meet.
+TEST(RKObjectIdentityTest, PrivateIdsMeetOnlyWhereTheirPidBitsDo) {
+    ScopedSettings settings(false);
+    auto privatePage = [](pid_t pid, uint64_t offset) {
+        return region(RKPrivateObjectId(pid, 0x10000000, 4096), offset, 4096, 4096);
+    };
+    constexpr pid_t kSameBits = 30 + (1 << 22);
+    auto p10 = makeProcess(10, {privatePage(10, 0), region(7, 0, 4096, 0), privatePage(10, 4096)});
+    auto p20 = makeProcess(20, {privatePage(20, 0), region(7, 0, 4096, 0)});
+    auto p30 = makeProcess(30, {privatePage(30, 0)});
+    auto twin = makeProcess(kSameBits, {privatePage(kSameBits, 0)});
+    RKMemspread memspread({p10, p20, p30, twin});
+    memspread.analyzeData();
+    auto objectOf = [](const auto& process, size_t i) { return (*process->memoryRegions())[i]->memoryObject(); };
+    EXPECT_EQ(objectOf(p10, 0), objectOf(p10, 2));
+    EXPECT_NE(objectOf(p10, 0), objectOf(p20, 0));
+    EXPECT_EQ(objectOf(p30, 0), objectOf(twin, 0));
+    EXPECT_EQ(memspread.pidToMemspread().at(10), 8192u);
+
+    const RKProcessToGroupsMap groups = memspread._generateProcessToProcessGroups();
+    const RKProcessGroup& own = *groups.at(10).front();
+    EXPECT_EQ(own.count(), 1u);
+    EXPECT_EQ(own.objects().size(), 1u);
+    EXPECT_EQ(groups.at(30).front()->count(), 2u);
 }
 
 // B maps memory that A owns: with the breakdown on, B sees its dirty and swapped bytes as clean.

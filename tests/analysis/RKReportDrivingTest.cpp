@@ -29,3 +29,22 @@ TEST(RKReportDrivingTest, AGlobalErrorAloneMeansTheReportHadErrors) {
     report({process}, {recorder});
     EXPECT_EQ(recorder->callsNamed("printSummaryCategories")[0].arguments, " dirty=4096 regions=1 [shared] hadErrors");
 }
+
+// A report releases its memory objects as it ends (sampling writes one report after another),
+// unless it is to leave them, with its processes and groups, to whoever takes its remains.
+TEST(RKReportDrivingTest, ObjectsOutliveTheReportOnlyInItsRemains) {
+    ScopedSettings settings(false);
+    for (bool keep : {false, true}) {
+        auto process = makeProcess(10, {region(1, 0, 4096, 4096)});
+        const RKMemoryRegion& mapping = *process->memoryRegions()->front();
+        RKMemspread memspread({process});
+        memspread.setKeepsReportRemains(keep);
+        memspread.analyzeData();
+        memspread.printOutputVerbose(false, false);
+        EXPECT_EQ(mapping.memoryObject() != nullptr, keep);
+        RKMemspread::ReportRemains remains = memspread.takeReportRemains();
+        EXPECT_EQ(remains.groups.size(), keep ? 1u : 0u);
+        remains = {};
+        EXPECT_EQ(mapping.memoryObject(), nullptr);
+    }
+}
