@@ -248,10 +248,10 @@ uint64_t RKMemspread::_calculateMemspreadForProcess(const RKProcess& process) co
         return memspread;
     }
     // Every process that maps an object is charged its whole dirty and swapped bytes, once.
-    RKPointerSet counted(regions.size());
+    RKPointerSet counted;
     for (const auto& region : regions) {
         std::shared_ptr<RKMemoryObject> object = region->memoryObject();
-        if (!object || !counted.insert(object.get())) continue;
+        if (!object || !RKFirstMeeting(counted, *object)) continue;
         memspread += object->totalDirtySize() + object->totalSwappedSize();
     }
     return memspread;
@@ -312,7 +312,7 @@ RKCategoryMap RKMemspread::_categoriesForAllProcessesShouldSummarize(bool summar
         if (process->hiddenFromDisplay() || !process->memoryRegions()) continue;
         for (const auto& region : *process->memoryRegions()) {
             std::shared_ptr<RKMemoryObject> object = region->memoryObject();
-            if (!object || !seen.insert(object.get())) continue;
+            if (!object || !RKFirstMeeting(seen, *object)) continue;
             categoryFor(*object).addMemoryObject(object);
         }
     }

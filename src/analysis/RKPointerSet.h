@@ -44,3 +44,12 @@ private:
     std::vector<const void*> slots_;
     size_t count_ = 0;
 };
+
+// In a walk over every region of every process, whether `object` is met for the first time. A
+// region is in one process's list only, so an object of one region is met once, through that
+// region, and takes no place in the set: most objects of a forking server, whose set would
+// otherwise hold hundreds of thousands.
+template <class Object>
+bool RKFirstMeeting(RKPointerSet& seen, const Object& object) {
+    return object.memoryRegions().size() == 1 || seen.insert(&object);
+}

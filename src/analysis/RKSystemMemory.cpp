@@ -39,7 +39,7 @@ RKSystemMemory RKAccountForSystemMemory(const RKProcessList& processes, bool bre
         }
         for (const auto& region : *process->memoryRegions()) {
             std::shared_ptr<RKMemoryObject> object = region->memoryObject();
-            if (!object || !seen.insert(object.get())) continue;
+            if (!object || !RKFirstMeeting(seen, *object)) continue;
             userMemory += static_cast<int64_t>(object->totalDirtySize() + object->totalReclaimableSize() +
                                                object->totalCleanSize());
         }
