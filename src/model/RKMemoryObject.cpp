@@ -18,6 +18,11 @@ static_assert(sizeof(void*) != 8 || sizeof(RKMemoryObject) <= 120);
 
 RKMemoryObject::RKMemoryObject() = default;
 
+RKMemoryObject::~RKMemoryObject() {
+    // A view or a copy shares regions that point elsewhere; forgetting checks.
+    for (const auto& region : memoryRegions_) region->forgetMemoryObject(this);
+}
+
 void RKMemoryObject::addRegion(const std::shared_ptr<RKMemoryRegion>& region, const RKProcess& process) {
     _addRegion(region, process.pageSize(), &process);
 }

@@ -27,6 +27,7 @@ using RKProcessRegionMap = std::map<pid_t, RKRegionList>;
 class RKMemoryObject : public std::enable_shared_from_this<RKMemoryObject> {
 public:
     RKMemoryObject();  // no regions, no owner, all totals 0
+    ~RKMemoryObject();  // its regions stop pointing at it
     RKMemoryObject(const RKMemoryObject&) = delete;
     RKMemoryObject& operator=(const RKMemoryObject&) = delete;
 

@@ -1,14 +1,19 @@
 #include "model/RKMemoryRegion.h"
 
 #include "model/RKAssert.h"
+#include "model/RKMemoryObject.h"
 #include "model/RKRangeList.h"
 #include "platform/RKKernelTypes.h"
 
 // One per mapping: a field added in the wrong place costs a padding hole per mapping.
-static_assert(sizeof(void*) != 8 || sizeof(RKMemoryRegion) <= 112);
+static_assert(sizeof(void*) != 8 || sizeof(RKMemoryRegion) <= 104);
 
 RKMemoryRegion::RKMemoryRegion() = default;
 RKMemoryRegion::~RKMemoryRegion() = default;
+
+std::shared_ptr<RKMemoryObject> RKMemoryRegion::memoryObject() const {
+    return memoryObject_ ? memoryObject_->weak_from_this().lock() : nullptr;
+}
 
 std::string RKMemoryRegion::fullName() const {
     if (detailedName.empty()) return name;
