@@ -34,7 +34,6 @@ struct RKProcessIdentity {
     // the process and need no entry in the maps below.
     RKMemoryObjectList privateObjects;
     std::vector<uint32_t> mappedRegions;  // indices of the regions whose objects the maps find
-    bool privateIdsRepeat = false;        // an object of privateObjects has two regions or more
 };
 
 // The maps own the memory objects from analysis until the sharing groups are built.

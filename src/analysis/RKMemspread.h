@@ -119,10 +119,6 @@ private:
     std::unique_ptr<RKIdentityMaps> identityMaps_;
 
     std::vector<bool> _privateIdsAlone() const;
-    // What identity found in processes_[index] alone; null before analysis or once it is over.
-    const RKProcessIdentity* _identityOf(size_t index) const {
-        return identityMaps_ && index < identityMaps_->byProcess.size() ? &identityMaps_->byProcess[index] : nullptr;
-    }
     static bool _addRegionToObject(const std::shared_ptr<RKMemoryObject>& object,
                                    const std::shared_ptr<RKMemoryRegion>& region, const RKProcess& process,
                                    bool breakDown);

@@ -145,9 +145,7 @@ void RKMemspread::_identifyPrivateObjects() {
     const std::vector<bool> alone = _privateIdsAlone();
     const bool breakDown = breakDownPhysMemspread();  // read once here: workers only read the cache
     // Each process's objects are its own: the processes are identified side by side.
-    RKWorkerPoolOptions options;
-    options.threads = RKOnlineCpuCount();
-    RKParallelApply(processes_.size(), options, [&](size_t p) {
+    RKParallelApplyOnEveryCpu(processes_.size(), [&](size_t p) {
         const RKProcess& process = *processes_[p];
         if (!process.memoryRegions()) return;
         const RKRegionList& regions = *process.memoryRegions();
@@ -164,8 +162,6 @@ void RKMemspread::_identifyPrivateObjects() {
             if (index == PrivateIdTable::kNew) {
                 index = static_cast<uint32_t>(own.privateObjects.size());
                 own.privateObjects.push_back(std::make_shared<RKMemoryObject>());
-            } else {
-                own.privateIdsRepeat = true;
             }
             _addRegionToObject(own.privateObjects[index], regions[i], process, breakDown);
         }
@@ -260,9 +256,7 @@ uint64_t RKMemspread::_calculateMemspreadForProcess(const RKProcess& process) co
 void RKMemspread::_buildProcessToMemspreadMap() {
     pidToMemspread_.clear();
     std::vector<uint64_t> memspread(processes_.size());
-    RKWorkerPoolOptions options;
-    options.threads = RKOnlineCpuCount();
-    RKParallelApply(processes_.size(), options, [&](size_t p) {
+    RKParallelApplyOnEveryCpu(processes_.size(), [&](size_t p) {
         if (!processes_[p]->hiddenFromDisplay()) memspread[p] = _calculateMemspreadForProcess(*processes_[p]);
     });
     pidToMemspread_.reserve(processes_.size());

@@ -5,6 +5,7 @@
 
 #include "analysis/RKBatchEnumeration.h"
 #include "analysis/RKMemspread.h"
+#include "analysis/RKPointerSet.h"
 #include "analysis/RKProcessSetTrie.h"
 #include "model/RKMemoryObject.h"
 #include "model/RKMemoryRegion.h"
@@ -24,14 +25,10 @@ bool hiddenProcessCounts(const RKMemoryObject& object, const std::unordered_set<
 
 RKProcessToGroupsMap RKMemspread::_generateProcessToProcessGroups() {
     std::unordered_set<pid_t> shownPids;
-    size_t regionCount = 0, mappedCount = 0;
-    for (size_t p = 0; p < processes_.size(); p++) {
-        const RKProcess& process = *processes_[p];
-        if (!process.hiddenFromDisplay()) shownPids.insert(process.pid());
-        if (!process.memoryRegions()) continue;
-        regionCount += process.memoryRegions()->size();
-        const RKProcessIdentity* identity = _identityOf(p);
-        mappedCount += identity ? identity->mappedRegions.size() : process.memoryRegions()->size();
+    size_t regionCount = 0;
+    for (const auto& process : processes_) {
+        if (!process->hiddenFromDisplay()) shownPids.insert(process->pid());
+        if (process->memoryRegions()) regionCount += process->memoryRegions()->size();
     }
 
     // Each object's mappers as a set of process numbers, objects in the order they are first
@@ -40,30 +37,19 @@ RKProcessToGroupsMap RKMemspread::_generateProcessToProcessGroups() {
     std::vector<std::shared_ptr<RKMemoryObject>> objects;
     std::vector<uint32_t> mappersOf;
     std::unordered_map<const RKMemoryObject*, uint32_t> indexOf;
-    objects.reserve(regionCount), mappersOf.reserve(regionCount), indexOf.reserve(mappedCount);
+    objects.reserve(regionCount), mappersOf.reserve(regionCount);
     for (uint32_t p = 0; p < processes_.size(); p++) {
         const RKProcess& process = *processes_[p];
         if (!process.memoryRegions()) continue;
         const bool hidden = process.hiddenFromDisplay();
-        // A private object is this process's alone and, unless two of its regions share it, met
-        // once here: it needs no entry in indexOf. The other regions are listed, ascending.
-        const RKProcessIdentity* identity = _identityOf(p);
-        const bool privateMetOnce = identity && !identity->privateIdsRepeat;
-        size_t nextMapped = 0;
         std::span<const std::shared_ptr<RKMemoryRegion>> regions(*process.memoryRegions());
         rk_enumerateObjectsWithBatchSize(regions, kRegionBatchSize, [&](const auto* batch, size_t count) {
             for (size_t i = 0; i < count; i++) {
-                bool metOnce = false;
-                if (privateMetOnce) {
-                    const auto index = static_cast<uint32_t>(batch + i - regions.data());
-                    const auto& mapped = identity->mappedRegions;
-                    metOnce = nextMapped == mapped.size() || mapped[nextMapped] != index;
-                    if (!metOnce) nextMapped++;
-                }
                 std::shared_ptr<RKMemoryObject> object = batch[i]->memoryObject();
                 if (!object) continue;  // never analyzed, or released after a previous report
                 if (hidden && !hiddenProcessCounts(*object, shownPids)) continue;
-                if (metOnce) {
+                // Met once (one region), it needs no entry in indexOf: most objects.
+                if (RKMetOnce(*object)) {
                     objects.push_back(std::move(object)), mappersOf.push_back(sets.with(RKProcessSetTrie::kEmpty, p));
                     continue;
                 }

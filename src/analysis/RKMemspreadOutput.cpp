@@ -110,9 +110,7 @@ void RKMemspread::_computePrivateGroupCategories(const RKProcessList& reported, 
         if (process->errors().empty()) work.emplace_back(list->second.front().get(), process.get());
     }
     std::erase_if(work, [&](const auto& item) { return listings[item.first] != 1; });
-    RKWorkerPoolOptions options;
-    options.threads = RKOnlineCpuCount();
-    RKParallelApply(work.size(), options, [&](size_t i) {
+    RKParallelApplyOnEveryCpu(work.size(), [&](size_t i) {
         auto [group, process] = work[i];
         group->attachCachedCategories(_categoriesForObjects(group->objects(), *process, nullptr, summarize), 1);
     });

@@ -45,11 +45,16 @@ private:
     size_t count_ = 0;
 };
 
-// In a walk over every region of every process, whether `object` is met for the first time. A
-// region is in one process's list only, so an object of one region is met once, through that
-// region, and takes no place in the set: most objects of a forking server, whose set would
-// otherwise hold hundreds of thousands.
+// Whether a walk over every region of every process meets `object` once only. A region is in
+// one process's list only, so an object of one region is met once, through that region: most
+// objects of a forking server, which then need no place in a set or a map of the walk.
+template <class Object>
+bool RKMetOnce(const Object& object) {
+    return object.memoryRegions().size() == 1;
+}
+
+// In such a walk, whether `object` is met for the first time.
 template <class Object>
 bool RKFirstMeeting(RKPointerSet& seen, const Object& object) {
-    return object.memoryRegions().size() == 1 || seen.insert(&object);
+    return RKMetOnce(object) || seen.insert(&object);
 }

@@ -137,9 +137,7 @@ private:
     // page's object, at the page's index there. A process writes its own regions and member
     // regions only: the processes run side by side.
     void attributePages() {
-        RKWorkerPoolOptions options;
-        options.threads = RKOnlineCpuCount();
-        RKParallelApply(processes_.size(), options, [this](size_t p) { attributePagesOf(static_cast<uint32_t>(p)); });
+        RKParallelApplyOnEveryCpu(processes_.size(), [this](size_t p) { attributePagesOf(static_cast<uint32_t>(p)); });
     }
 
     void attributePagesOf(uint32_t p) {

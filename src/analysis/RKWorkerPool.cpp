@@ -45,3 +45,9 @@ void RKParallelApply(size_t count, const RKWorkerPoolOptions& options, const std
     }
     for (auto& thread : workers) thread.join();
 }
+
+void RKParallelApplyOnEveryCpu(size_t count, const std::function<void(size_t)>& work) {
+    RKWorkerPoolOptions options;
+    options.threads = RKOnlineCpuCount();
+    RKParallelApply(count, options, work);
+}

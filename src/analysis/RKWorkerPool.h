@@ -17,3 +17,7 @@ void RKAddThreadNiceness(int increment);
 
 // One worker per online CPU.
 size_t RKOnlineCpuCount();
+
+// RKParallelApply with one worker per online CPU at the caller's priority: the analysis's
+// side-by-side steps.
+void RKParallelApplyOnEveryCpu(size_t count, const std::function<void(size_t)>& work);

@@ -271,11 +271,10 @@ bool RKIsPrivateObjectIdOf(uint64_t id, pid_t pid) {
 }
 
 uint64_t RKPrivateObjectId(pid_t pid, uint64_t start, uint64_t pageSize) {
-    constexpr uint64_t kFlag = kPrivateFlag;
     uint64_t page = start / (pageSize ? pageSize : 4096);
     uint64_t pidBits = RKPrivateObjectIdPidBits(pid);
     // Exact for every address below 2^52 with 4 KiB pages; beyond, mixed (still never an
     // object id, 0 or all ones).
-    if (page < (1ull << kPrivatePidShift)) return kFlag | pidBits << kPrivatePidShift | page;
-    return kFlag | (mix64(pidBits ^ mix64(page)) & (kFlag - 1));
+    if (page < (1ull << kPrivatePidShift)) return kPrivateFlag | pidBits << kPrivatePidShift | page;
+    return kPrivateFlag | (mix64(pidBits ^ mix64(page)) & (kPrivateFlag - 1));
 }

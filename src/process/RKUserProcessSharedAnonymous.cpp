@@ -33,19 +33,15 @@ void RKUserProcess::_gatherSharedAnonymousPages(RKRegionWalkState& state) {
     if (state.forkSharingDisabled) {
         // Only the bound: the regions keep their pages, as where frames are hidden.
         unattributedSharedAnonymousBytes_ = RKPlatform::current().sharedAnonymousBytes(*task_, state.sharedAnonymousRanges);
-        state.sharedAnonymousRegions.clear();
-        state.sharedAnonymousRanges.clear();
-        return;
-    }
-    uint64_t sharedBytes = 0;
-    std::vector<RKSharedAnonymousPage> pages;
-    kern_return_t result =
-        RKPlatform::current().sharedAnonymousPages(*task_, state.sharedAnonymousRanges, pages, sharedBytes);
-    if (result == KERN_SUCCESS) {
-        sharedAnonymousPages_ = RKSharedPageList(std::move(pages));
-        sharedAnonymousRegions_ = std::move(state.sharedAnonymousRegions);
     } else {
-        if (result == KERN_NOT_SUPPORTED) {
+        uint64_t sharedBytes = 0;
+        std::vector<RKSharedAnonymousPage> pages;
+        kern_return_t result =
+            RKPlatform::current().sharedAnonymousPages(*task_, state.sharedAnonymousRanges, pages, sharedBytes);
+        if (result == KERN_SUCCESS) {
+            sharedAnonymousPages_ = RKSharedPageList(std::move(pages));
+            sharedAnonymousRegions_ = std::move(state.sharedAnonymousRegions);
+        } else if (result == KERN_NOT_SUPPORTED) {
             unattributedSharedAnonymousBytes_ = sharedBytes;
         } else if (!pageQueryFailed_) {
             mach_error("shared anonymous pages", result);
