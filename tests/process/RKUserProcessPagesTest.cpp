@@ -156,11 +156,8 @@ TEST_F(RKUserProcessPagesTest, PageDataIsReadOnceForEligibleRegions) {
         RKScriptedRegion region;
         region.start = start;
         region.size = 4 * P;
-        region.info.share_mode = shareMode;
-        region.info.pages_resident = resident;
-        region.info.pages_dirtied = dirtied;
-        region.info.external_pager = file ? 1 : 0;
-        region.info.object_id_full = start;
+        region.info = {.pages_resident = resident, .pages_dirtied = dirtied,
+                       .external_pager = static_cast<uint8_t>(file), .share_mode = shareMode, .object_id_full = start};
         return region;
     };
     tool().regions = {entry(0x10000, SM_SHARED, 2, 2, false), entry(0x20000, SM_PRIVATE, 2, 2, false),
