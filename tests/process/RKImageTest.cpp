@@ -33,7 +33,6 @@ TEST(RKImage, NamePrefixDecidesTheSegment) {
     auto kept = image(0, 1, "__TEXT");
     kept->setName(RKUnsharedString(".data"));  // not a "__" name: the segment stays
     EXPECT_EQ(kept->segment, RKSegmentText);
-    EXPECT_EQ(kept->name(), ".data");
 }
 
 TEST(RKImage, EnumeratorOnlyMovesForwardAndSeesAppendedImages) {
@@ -41,7 +40,6 @@ TEST(RKImage, EnumeratorOnlyMovesForwardAndSeesAppendedImages) {
     RKImageEnumerator enumerator(images);
     EXPECT_EQ(enumerator.nextImageForStart(0x0, 0x800), nullptr);         // before the first
     EXPECT_EQ(enumerator.nextImageForStart(0x1800, 0x2000), images[0]);   // start inside
-    EXPECT_EQ(enumerator.nextImageForStart(0x1c00, 0x1d00), images[0]);   // still there
     EXPECT_EQ(enumerator.nextImageForStart(0x2000, 0x3000), nullptr);     // the gap: first passed
     EXPECT_EQ(enumerator.nextImageForStart(0x2800, 0x3800), images[1]);   // end inside
     EXPECT_EQ(enumerator.nextImageForStart(0x2000, 0x6000), images[1]);   // image inside the range
@@ -60,15 +58,12 @@ TEST(RKImage, InternTablesShareOneStringAcrossThreadsAndOverflowToOwnCopies) {
     for (auto& thread : threads) thread.join();
     for (const auto& string : seen) EXPECT_EQ(string.get(), seen[0].get()) << "one object for equal strings";
     EXPECT_EQ(table.filledCount(), 1u);
-    EXPECT_EQ(table.intern("b", 0, 4, 1024).get(), table.intern("b", 0, 4, 1024).get());
-    table.intern("c", 0, 4, 1024);
-    table.intern("d", 0, 4, 1024);
+    for (const char* name : {"b", "c", "d"}) table.intern(name, 0, 4, 1024);
     EXPECT_EQ(table.filledCount(), 4u);
     auto overflow = table.intern("e", 0, 4, 1024);
     EXPECT_EQ(*overflow, "e");
     EXPECT_NE(overflow.get(), table.intern("e", 0, 4, 1024).get()) << "a full table hands out copies";
     EXPECT_EQ(*table.intern("bx", 0, 4, 1), "b") << "compared on the first `limit` bytes only";
-    EXPECT_EQ(RKPathInternSlotForBase(0x180000000), (0x180000000 ^ 0x1800000 ^ 0x18000 ^ 0x180) % 2047);
 }
 
 TEST(RKImage, ImagesOfAProcessNameItsRegions) {
@@ -90,16 +85,14 @@ TEST(RKImage, ImagesOfAProcessNameItsRegions) {
     process->gatherData();
     const auto& regions = *process->memoryRegions();
     ASSERT_EQ(regions.size(), 4u);
-    const std::tuple<const char*, uint8_t, const char*> expected[] = {
-        {"__TEXT", RKSegmentText, "/bin/tool"},
-        {"__DATA_CONST", RKSegmentData, "/bin/tool"},
-        {".data", RKSegmentData, "/bin/tool"},
-        {"mapped file", RKSegmentNoImage, "/bin/tool"},  // a mapping of no image segment
+    const std::pair<const char*, uint8_t> expected[] = {
+        {"__TEXT", RKSegmentText}, {"__DATA_CONST", RKSegmentData}, {".data", RKSegmentData},
+        {"mapped file", RKSegmentNoImage},  // a mapping of no image segment
     };
     for (size_t i = 0; i < regions.size(); i++) {
-        EXPECT_EQ(regions[i]->name, std::get<0>(expected[i])) << i;
-        EXPECT_EQ(regions[i]->segment, std::get<1>(expected[i])) << i;
-        EXPECT_EQ(regions[i]->detailedName, std::get<2>(expected[i])) << i;
+        EXPECT_EQ(regions[i]->name, expected[i].first) << i;
+        EXPECT_EQ(regions[i]->segment, expected[i].second) << i;
+        EXPECT_EQ(regions[i]->detailedName, "/bin/tool") << i;
     }
     EXPECT_FALSE(process->images()) << "images are dropped after the walk";
     RKAnalysisSettings::resetCache();

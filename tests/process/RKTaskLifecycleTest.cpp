@@ -18,10 +18,8 @@ RKScriptedRegion region(uint64_t start, uint64_t pages, uint32_t dirtied) {
     RKScriptedRegion entry;
     entry.start = start;
     entry.size = pages * P;
-    entry.info.pages_resident = dirtied;
-    entry.info.pages_dirtied = dirtied;
-    entry.info.share_mode = SM_PRIVATE;
-    entry.info.object_id_full = 0x4000000000000000ull | start;
+    entry.info = {.pages_resident = dirtied, .pages_dirtied = dirtied, .share_mode = SM_PRIVATE,
+                  .object_id_full = 0x4000000000000000ull | start};
     return entry;
 }
 

@@ -72,10 +72,8 @@ TEST_F(RKVmsnapTest, GraphSurvivesTheFileCompressedAndEveryDamageIsAnError) {
     EXPECT_EQ(back->sharedAnonymousPages[0].keys, graph.sharedAnonymousPages[0].keys);
     EXPECT_EQ(back->unattributedSharedAnonymousBytes, 0x3000u);
 
-    const std::string plain = snapshot("Linux");
     const std::pair<std::string, std::string> damaged[] = {
         {"", "not valid JSON"},
-        {plain.substr(0, plain.size() - 5), "not valid JSON"},
         {bytes.substr(0, bytes.size() / 2), "truncated compressed data"},
         {bytes.substr(0, 4) + std::string(40, 'x'), "damaged compressed data"},
         {bytes + bytes, "data after the end"},
