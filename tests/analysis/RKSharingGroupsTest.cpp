@@ -44,9 +44,7 @@ TEST(RKSharingGroupsTest, LargeGroupsShareOneCategoryComputation) {
         auto recorder = std::make_shared<RKRecordingFormatter>();
         report(processes, {recorder});
         std::set<const void*> made;
-        for (const auto& call : recorder->callsNamed("printSharedCategories")) {
-            made.insert(call.categoriesIdentity());
-        }
+        for (const auto& call : recorder->callsNamed("printSharedCategories")) made.insert(call.categoriesIdentity());
         EXPECT_EQ(made.size(), computations);
     }
 }

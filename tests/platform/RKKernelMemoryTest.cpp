@@ -73,12 +73,10 @@ protected:
 
 TEST_F(RKKernelMemoryTest, ParsersReadEveryLineOfTheCapturesAndRefuseWhatIsNotTheirFormat) {
     EXPECT_EQ(figure("MemTotal"), 24684084ull * 1024);
-    EXPECT_EQ(figure("HugePages_Total"), 0u) << "a page count stays a count";
     EXPECT_FALSE(RKParseMeminfo("garbage\n: 12 kB\nName: twelve kB\n"));
 
     std::vector<RKSlabCache> caches;
     auto slab = RKParseSlabinfo(slabinfo, caches);
-    EXPECT_TRUE(slab.knownVersion);
     EXPECT_EQ(slab.malformedLines, 0u);
     ASSERT_EQ(caches.size(), 235u);
     caches.clear();
@@ -107,7 +105,6 @@ TEST_F(RKKernelMemoryTest, ParsersReadEveryLineOfTheCapturesAndRefuseWhatIsNotTh
 
 TEST_F(RKKernelMemoryTest, AsRootTheRecordsAddUpToTheKernelsOwnFiguresWithStacksOnce) {
     answer = read(true, false);
-    EXPECT_FALSE(answer.restricted);
 
     // vmalloc'd thread stacks, counted here from the capture itself.
     uint64_t stackPages = 0;
@@ -167,7 +164,6 @@ TEST_F(RKKernelMemoryTest, ModulesAreCountedOnceAndWithoutRootOnlyMeminfoIsAnswe
         << "module memory is vmalloc memory: counted once, under the modules";
 
     answer = read(false, false);
-    EXPECT_TRUE(answer.restricted);
     ASSERT_EQ(answer.zones.size(), 2u);
     EXPECT_EQ(nameOf(answer.zoneNames[1].mzn_name), "slab (reclaimable)");
     EXPECT_EQ(answer.zones[1].mzi_cur_size, figure("SReclaimable"));
