@@ -188,21 +188,4 @@ TEST(RKPageLevel, ProcessThatExitsBeforeItsPageQueryIsAWarning) {
     close(input[1]);
 }
 
-// Each process's memspread is the kernel's own figure (RssAnon + RssShmem + VmSwap − LazyFree,
-// plus its page tables) and the dirty pages of the files it maps shared, which the kernel's
-// figure leaves to the page cache.
-TEST(RKPageLevel, MemspreadEqualsTheKernelsFigure) {
-    RKFixtureProcess fixture;
-    ASSERT_TRUE(fixture.start(MEMSPREAD_FIXTURE)) << fixture.error();
-    const pid_t parent = fixture.pid(), child = fixture.childPid();
-    RKCommandResult run =
-        RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", std::to_string(parent), std::to_string(child)});
-    ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
-    const uint64_t shared = fixture.area("file_shared")->address;
-    EXPECT_EQ(RKReportedMemspread(run.standardOutput, parent),
-              RKKernelMemspread(parent) + RKKernelField(parent, "smaps", "Shared_Dirty", shared) +
-                  RKKernelField(parent, "smaps", "Private_Dirty", shared));
-    EXPECT_EQ(RKReportedMemspread(run.standardOutput, child), RKKernelMemspread(child));
-}
-
 }  // namespace

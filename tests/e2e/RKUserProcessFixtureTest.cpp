@@ -1,8 +1,8 @@
 // A live process measured end to end: the fixture maps one area of each kind and forks a child
 // that shares the shared kinds. Gathered in this process, each area must come out as a region of
 // the right name, detail, share mode, identity and size; through the binary, the report must
-// show the shared kinds once, in the block of memory the two processes share, and the JSON
-// document of the same run must parse and agree with it.
+// show the shared kinds once, in the block of memory the two processes share, each process at
+// the kernel's own figure, and the JSON document of the same run must parse and agree with it.
 #include <gtest/gtest.h>
 #include <unistd.h>
 
@@ -120,6 +120,13 @@ TEST(RKUserProcessFixture, ReportShowsSharedMemoryOnceTheDocumentAgreesAndAllPro
         once += own["TOTAL"];
     }
     EXPECT_EQ(summary["TOTAL"], once) << report;
+    // Each process costs what the kernel charges it (RssAnon + RssShmem + VmSwap + VmPTE − LazyFree),
+    // plus the dirty pages of the file it maps shared, which the kernel leaves to the page cache.
+    const uint64_t fileShared = fixture.area("file_shared")->address;
+    EXPECT_EQ(RKReportedMemspread(report, fixture.pid()),
+              RKKernelMemspread(fixture.pid()) + RKKernelField(fixture.pid(), "smaps", "Shared_Dirty", fileShared) +
+                  RKKernelField(fixture.pid(), "smaps", "Private_Dirty", fileShared));
+    EXPECT_EQ(RKReportedMemspread(report, fixture.childPid()), RKKernelMemspread(fixture.childPid()));
 
     // The document holds each process's header figure, in pid order, and one shared record of the two.
     const pid_t low = std::min(fixture.pid(), fixture.childPid()), high = std::max(fixture.pid(), fixture.childPid());
