@@ -123,11 +123,7 @@ TEST(RKAllProcesses, CompleteReportWhileProcessesComeAndGo) {
         // A run takes a second or two; the bound is for a loaded machine and only stops a hang.
         RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, "-a", "-j", document.string()}, 120s);
         runs++;
-        ASSERT_TRUE(run.started) << "run " << runs << " could not be started";
-        ASSERT_TRUE(run.exitedWith(0)) << "run " << runs << " did not exit 0 within two minutes ("
-                                       << (run.exitStatus ? "status " + std::to_string(*run.exitStatus)
-                                                          : std::string("killed or timed out"))
-                                       << "):\n" << run.standardError;
+        ASSERT_TRUE(run.exitedWith(0)) << "run " << runs << " failed, was killed or timed out:\n" << run.standardError;
         ASSERT_NE(run.standardOutput.find("Summary Memspread:"), std::string::npos) << "run " << runs;
         auto measured = measuredPids(document);
         ASSERT_TRUE(measured) << "run " << runs << ": the document does not parse";
@@ -136,5 +132,4 @@ TEST(RKAllProcesses, CompleteReportWhileProcessesComeAndGo) {
     churn.stop();
     fs::remove(document);
     std::printf("%d runs of -a in %llds of churn\n", runs, static_cast<long long>(duration.count()));
-    EXPECT_GE(runs, 1);
 }

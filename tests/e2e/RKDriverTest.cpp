@@ -207,7 +207,7 @@ TEST_F(RKDriverTest, AnUnprivilegedUser) {
     fs::permissions(directory_, fs::perms::all);
     fs::permissions(json, fs::perms::all);
     for (const std::vector<std::string>& arguments :
-         {std::vector<std::string>{"-a"}, {"--unmapped", "1"}, {"-a", "-j", json}}) {
+         {std::vector<std::string>{"--unmapped", "1"}, {"-a", "-j", json}}) {
         RKCommandResult result = RKRunCommand(RKCommandAsNobody(arguments));
         EXPECT_TRUE(result.exitedWith(1)) << arguments.front();
         EXPECT_EQ(result.standardError, "Must run as root.\n") << arguments.front();

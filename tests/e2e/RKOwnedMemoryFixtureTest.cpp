@@ -9,10 +9,10 @@
 
 #include <algorithm>
 #include <cstring>
-#include <fstream>
 #include <regex>
 #include <tuple>
 
+#include "RKKernelFigures.h"
 #include "model/RKMemoryRegion.h"
 #include "process/RKAnalysisSettings.h"
 #include "process/RKUserProcess.h"
@@ -24,36 +24,12 @@ namespace {
 const uint64_t P = static_cast<uint64_t>(sysconf(_SC_PAGESIZE));
 constexpr uint64_t MiB = 1024 * 1024;
 
-// (RssAnon + RssShmem + VmSwap + VmPTE) of /proc/PID/status, in bytes: what the process costs
-// through its mappings and page tables.
-uint64_t kernelMappedFigure(pid_t pid) {
-    std::ifstream status("/proc/" + std::to_string(pid) + "/status");
-    uint64_t sum = 0;
-    for (std::string line; std::getline(status, line);) {
-        for (const char* field : {"RssAnon:", "RssShmem:", "VmSwap:", "VmPTE:"})
-            if (line.rfind(field, 0) == 0) sum += std::stoull(line.substr(std::strlen(field))) * 1024;
-    }
-    return sum;
-}
-
 // Anonymous pages (copies in private file mappings too) that `pid` maps together with another
-// process, over two: Anonymous - Pss_Anon of smaps_rollup, in bytes. Over a pair that shares
-// them after fork, the sum is the pages both figures count.
+// process, over two: Anonymous - Pss_Anon of smaps_rollup. Over a pair that shares them after
+// fork, the sum is the pages both figures count.
 uint64_t halfOfSharedAnonymous(pid_t pid) {
-    std::ifstream rollup("/proc/" + std::to_string(pid) + "/smaps_rollup");
-    uint64_t anonymous = 0, pss = 0;
-    for (std::string line; std::getline(rollup, line);) {
-        if (line.rfind("Anonymous:", 0) == 0) anonymous = std::stoull(line.substr(10)) * 1024;
-        if (line.rfind("Pss_Anon:", 0) == 0) pss = std::stoull(line.substr(9)) * 1024;
-    }
-    return anonymous - std::min(anonymous, pss);
-}
-
-// The memspread figure of the header of process `pid` in a report in bytes.
-uint64_t reportedMemspread(const std::string& report, pid_t pid) {
-    std::smatch match;
-    std::regex header("\\[" + std::to_string(pid) + "\\]: 64-bit\tMemspread: (\\d+) B");
-    return std::regex_search(report, match, header) ? std::stoull(match[1]) : 0;
+    const uint64_t anonymous = RKKernelField(pid, "smaps_rollup", "Anonymous");
+    return anonymous - std::min(anonymous, RKKernelField(pid, "smaps_rollup", "Pss_Anon"));
 }
 
 // The Dirty of the memfd row in the first "Shared with <sharer>" block after `pid`'s header.
@@ -83,7 +59,7 @@ TEST_F(RKOwnedMemoryFixtureTest, HeldMemoryIsOwnedAndPrivateShmemIsDirty) {
     auto process = RKProcess::processWithPid(fixture.pid());
     ASSERT_TRUE(process);
     process->gatherData();
-    const uint64_t kernel = kernelMappedFigure(fixture.pid());
+    const uint64_t kernel = RKKernelMemspread(fixture.pid());
 
     uint64_t memspread = 0, unmapped = 0;
     std::vector<uint64_t> unmappedSizes;
@@ -122,10 +98,10 @@ TEST_F(RKOwnedMemoryFixtureTest, MapperSharesTheHeldMemfdAndUnmappedFindsIt) {
     const uint64_t sharedAfterFork = halfOfSharedAnonymous(holder) + halfOfSharedAnonymous(mapper);
     EXPECT_GT(sharedAfterFork, 0u);
     EXPECT_EQ(std::stoull(summary[1]),
-              reportedMemspread(report, holder) + reportedMemspread(report, mapper) - sharedAfterFork)
+              RKReportedMemspread(report, holder) + RKReportedMemspread(report, mapper) - sharedAfterFork)
         << report;
-    EXPECT_LT(reportedMemspread(report, mapper), 64 * MiB);
-    const uint64_t holderMemspread = reportedMemspread(report, holder);
+    EXPECT_LT(RKReportedMemspread(report, mapper), 64 * MiB);
+    const uint64_t holderMemspread = RKReportedMemspread(report, holder);
     EXPECT_GE(holderMemspread, heldUnmapped() + 8 * MiB);
 
     // The mapper is not a target: --unmapped finds it, hidden, as the memfd's other process.
@@ -133,8 +109,8 @@ TEST_F(RKOwnedMemoryFixtureTest, MapperSharesTheHeldMemfdAndUnmappedFindsIt) {
     run = RKRunCommand({MEMSPREAD_BINARY, "--unmapped", "-f", "bytes", std::to_string(holder)});
     ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
     EXPECT_EQ(sharedMemfdDirty(run.standardOutput, holder, mapper), 64 * MiB) << run.standardOutput;
-    EXPECT_EQ(reportedMemspread(run.standardOutput, mapper), 0u) << "hidden";
-    EXPECT_NEAR(static_cast<double>(reportedMemspread(run.standardOutput, holder)),
+    EXPECT_EQ(RKReportedMemspread(run.standardOutput, mapper), 0u) << "hidden";
+    EXPECT_NEAR(static_cast<double>(RKReportedMemspread(run.standardOutput, holder)),
                 static_cast<double>(holderMemspread), 4.0 * P);
 }
 

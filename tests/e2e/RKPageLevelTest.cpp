@@ -10,9 +10,9 @@
 #include <algorithm>
 #include <csignal>
 #include <fstream>
-#include <map>
 #include <regex>
 
+#include "RKKernelFigures.h"
 #include "model/RKMemoryRegion.h"
 #include "model/RKRangeList.h"
 #include "process/RKAnalysisSettings.h"
@@ -26,19 +26,6 @@ namespace {
 
 const uint64_t P = static_cast<uint64_t>(sysconf(_SC_PAGESIZE));
 const uint64_t MiB = 1 << 20;
-
-// A "Name: N kB" field, in bytes, of the smaps entry at `address` (or of a status-like file).
-uint64_t kernelField(const std::string& file, const std::string& field, uint64_t address = 0) {
-    std::ifstream in(file);
-    std::string line;
-    bool inside = address == 0;
-    while (std::getline(in, line)) {
-        unsigned long long start = 0, end = 0;
-        if (std::sscanf(line.c_str(), "%llx-%llx ", &start, &end) == 2) inside = address == 0 || start == address;
-        if (inside && line.rfind(field + ":", 0) == 0) return std::stoull(line.substr(field.size() + 1)) * 1024;
-    }
-    return 0;
-}
 
 // Anonymous pages of the private mappings of `pid` that other mappings hold too, in bytes, as
 // smaps tells them: Shared_Clean + Shared_Dirty of anonymous memory; of a private file (or
@@ -111,7 +98,6 @@ TEST(RKPageLevel, HalvesWrittenByParentAndChildCountOnceEach) {
 TEST(RKPageLevel, PageStatesAgreeWithTheKernelsCounts) {
     RKFixtureProcess fixture;
     ASSERT_TRUE(fixture.start(MEMSPREAD_HALVES_FIXTURE)) << fixture.error();
-    const std::string proc = "/proc/" + std::to_string(fixture.pid());
     auto parent = gathered(fixture.pid());
     ASSERT_TRUE(parent);
 
@@ -125,7 +111,7 @@ TEST(RKPageLevel, PageStatesAgreeWithTheKernelsCounts) {
     const uint64_t lockedAddress = fixture.area("locked_file")->address;
     const RKMemoryRegion* locked = regionAt(*parent, lockedAddress);
     ASSERT_TRUE(locked);
-    EXPECT_EQ(locked->wiredSize(), kernelField(proc + "/smaps", "Locked", lockedAddress));
+    EXPECT_EQ(locked->wiredSize(), RKKernelField(fixture.pid(), "smaps", "Locked", lockedAddress));
     if (locked->subrangeList()) {
         EXPECT_EQ(locked->subrangeList()->sum().wired, 16 * P) << "every run is wired";
     }
@@ -138,7 +124,7 @@ TEST(RKPageLevel, PageStatesAgreeWithTheKernelsCounts) {
     uint64_t reclaimable = 0;
     for (const std::string& line : RKSplitLines(run.standardOutput))
         if (std::regex_match(line, match, row)) reclaimable += std::stoull(match[1]);
-    EXPECT_EQ(reclaimable, kernelField(proc + "/smaps_rollup", "LazyFree"));
+    EXPECT_EQ(reclaimable, RKKernelField(fixture.pid(), "smaps_rollup", "LazyFree"));
     EXPECT_GT(reclaimable, 0u) << run.standardOutput;
 }
 
@@ -200,36 +186,6 @@ TEST(RKPageLevel, ProcessThatExitsBeforeItsPageQueryIsAWarning) {
     EXPECT_TRUE(process->errors().empty());
     EXPECT_TRUE(process->memoryRegions()) << "the run goes on with the regions of the walk";
     close(input[1]);
-}
-
-}  // namespace
-
-namespace {
-
-// Each process's memspread is the kernel's own figure (RssAnon + RssShmem + VmSwap − LazyFree,
-// plus its page tables) and the dirty pages of the files it maps shared, which the kernel's
-// figure leaves to the page cache.
-TEST(RKPageLevel, MemspreadEqualsTheKernelsFigure) {
-    RKFixtureProcess fixture;
-    ASSERT_TRUE(fixture.start(MEMSPREAD_FIXTURE)) << fixture.error();
-    const std::string parent = std::to_string(fixture.pid()), child = std::to_string(fixture.childPid());
-    RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", parent, child});
-    ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
-    for (const std::string& pid : {parent, child}) {
-        SCOPED_TRACE(pid);
-        const std::string proc = "/proc/" + pid;
-        uint64_t kernel = kernelField(proc + "/status", "RssAnon") + kernelField(proc + "/status", "RssShmem") +
-                          kernelField(proc + "/status", "VmSwap") + kernelField(proc + "/status", "VmPTE") -
-                          kernelField(proc + "/smaps_rollup", "LazyFree");
-        if (pid == parent) {
-            uint64_t shared = fixture.area("file_shared")->address;
-            kernel += kernelField(proc + "/smaps", "Shared_Dirty", shared) + kernelField(proc + "/smaps", "Private_Dirty", shared);
-        }
-        std::smatch match;
-        std::regex header("\\[" + pid + "\\]: 64-bit\tMemspread: (\\d+) B");
-        ASSERT_TRUE(std::regex_search(run.standardOutput, match, header));
-        EXPECT_EQ(std::stoull(match[1]), kernel);
-    }
 }
 
 }  // namespace

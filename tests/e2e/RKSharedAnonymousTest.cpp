@@ -6,10 +6,9 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <fstream>
-#include <map>
 #include <regex>
 
+#include "RKKernelFigures.h"
 #include "support/RKFixtureProcess.h"
 #include "support/RKReportRows.h"
 #include "support/RKRunCommand.h"
@@ -18,26 +17,12 @@ namespace {
 
 const uint64_t P = static_cast<uint64_t>(sysconf(_SC_PAGESIZE));
 
-// A "Field: N kB" line of a /proc file, in bytes; with no field, the file's first number.
-uint64_t statusField(pid_t pid, const std::string& file, const std::string& field) {
-    std::ifstream in("/proc/" + std::to_string(pid) + "/" + file);
-    if (field.empty()) {
-        uint64_t value = 0;
-        in >> value;
-        return value;
-    }
-    std::string line;
-    while (std::getline(in, line))
-        if (line.rfind(field + ":", 0) == 0) return std::stoull(line.substr(field.size() + 1)) * 1024;
-    return 0;
-}
-
-std::vector<pid_t> treeOf(const RKFixtureProcess& fixture, const std::string& report) {
+// The pids of the processes a report has a header for.
+std::vector<pid_t> reportedPids(const std::string& report) {
     std::vector<pid_t> pids;
     static const std::regex header(R"(\[(\d+)\]: 64-bit\tMemspread:)");
     for (std::sregex_iterator it(report.begin(), report.end(), header), end; it != end; ++it)
         pids.push_back(std::stoi((*it)[1]));
-    (void)fixture;
     return pids;
 }
 
@@ -48,21 +33,15 @@ TEST(RKSharedAnonymous, ForkedWorkersShareTheirParentsMemoryOnce) {
     RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", "-t", std::to_string(fixture.pid())});
     ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
     const std::string& report = run.standardOutput;
-    const std::vector<pid_t> tree = treeOf(fixture, report);
+    const std::vector<pid_t> tree = reportedPids(report);
     ASSERT_EQ(tree.size(), 21u) << report;
 
     // The tree's unique anonymous memory, and each process's own figure, from the kernel.
     uint64_t pssAnon = 0;
     for (pid_t pid : tree) {
         SCOPED_TRACE(pid);
-        pssAnon += statusField(pid, "smaps_rollup", "Pss_Anon");
-        const uint64_t kernel = statusField(pid, "status", "RssAnon") + statusField(pid, "status", "RssShmem") +
-                                statusField(pid, "status", "VmSwap") + statusField(pid, "status", "VmPTE") -
-                                statusField(pid, "smaps_rollup", "LazyFree");
-        std::smatch match;
-        std::regex header("\\[" + std::to_string(pid) + "\\]: 64-bit\tMemspread: (\\d+) B");
-        ASSERT_TRUE(std::regex_search(report, match, header));
-        EXPECT_EQ(std::stoull(match[1]), kernel);
+        pssAnon += RKKernelField(pid, "smaps_rollup", "Pss_Anon");
+        EXPECT_EQ(RKReportedMemspread(report, pid), RKKernelMemspread(pid));
     }
     auto summary = RKDirtyByCategory(report, "Summary Memspread: ");
     // Anonymous pages in the kernel's sense live in these categories: a private file mapping's

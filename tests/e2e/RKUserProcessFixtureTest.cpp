@@ -1,16 +1,16 @@
 // A live process measured end to end: the fixture maps one area of each kind and forks a child
 // that shares the shared kinds. Gathered in this process, each area must come out as a region of
 // the right name, detail, share mode, identity and size; through the binary, the report must
-// show the shared kinds once, in the block of memory the two processes share, and the JSON
-// document of the same run must parse and agree with it.
+// show the shared kinds once, in the block of memory the two processes share, each process at
+// the kernel's own figure, and the JSON document of the same run must parse and agree with it.
 #include <gtest/gtest.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <filesystem>
 #include <map>
-#include <regex>
 
+#include "RKKernelFigures.h"
 #include "model/RKMemoryRegion.h"
 #include "process/RKAnalysisSettings.h"
 #include "process/RKUserProcess.h"
@@ -120,16 +120,19 @@ TEST(RKUserProcessFixture, ReportShowsSharedMemoryOnceTheDocumentAgreesAndAllPro
         once += own["TOTAL"];
     }
     EXPECT_EQ(summary["TOTAL"], once) << report;
+    // Each process costs what the kernel charges it (RssAnon + RssShmem + VmSwap + VmPTE − LazyFree),
+    // plus the dirty pages of the file it maps shared, which the kernel leaves to the page cache.
+    const uint64_t fileShared = fixture.area("file_shared")->address;
+    EXPECT_EQ(RKReportedMemspread(report, fixture.pid()),
+              RKKernelMemspread(fixture.pid()) + RKKernelField(fixture.pid(), "smaps", "Shared_Dirty", fileShared) +
+                  RKKernelField(fixture.pid(), "smaps", "Private_Dirty", fileShared));
+    EXPECT_EQ(RKReportedMemspread(report, fixture.childPid()), RKKernelMemspread(fixture.childPid()));
 
     // The document holds each process's header figure, in pid order, and one shared record of the two.
     const pid_t low = std::min(fixture.pid(), fixture.childPid()), high = std::max(fixture.pid(), fixture.childPid());
     std::string expected;
-    for (const pid_t pid : {low, high}) {
-        std::smatch figure;
-        const std::string number = std::to_string(pid);
-        ASSERT_TRUE(std::regex_search(report, figure, std::regex("\\[" + number + "\\]: 64-bit\tMemspread: (-?\\d+) B")));
-        expected += number + " " + figure[1].str() + "\n";
-    }
+    for (const pid_t pid : {low, high})
+        expected += std::to_string(pid) + " " + std::to_string(RKReportedMemspread(report, pid)) + "\n";
     expected += "shared " + std::to_string(low) + " " + std::to_string(high) + "\n";
     EXPECT_TRUE(parsed.standardOutput.starts_with(expected)) << parsed.standardOutput << "expected:\n" << expected;
 

@@ -56,26 +56,22 @@ TEST_F(RKVmsnapEndToEnd, SavedStoppedProcessesReportLikeTheLiveOnes) {
     Stopped stopped({fixture.pid(), fixture.childPid()});
 
     const std::string one = (directory_ / "parent.vmsnap").string();
-    RKCommandResult saved = RKRunCommand({VMSNAP_BINARY, "-o", one, parent});
-    ASSERT_TRUE(saved.exitedWith(0)) << saved.standardError;
-    RKCommandResult live = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", parent});
-    RKCommandResult fromFile = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", one});
-    ASSERT_TRUE(fromFile.exitedWith(0)) << fromFile.standardError;
-    EXPECT_NE(fromFile.standardOutput.find("[" + parent + "] (vmsnap): 64-bit"), std::string::npos);
-    EXPECT_EQ(withoutVmsnapMarks(fromFile.standardOutput), live.standardOutput);
-
-    // Parent and child together: their shared memory (the memfd among it) in their pair's group.
+    ASSERT_TRUE(RKRunCommand({VMSNAP_BINARY, "-o", one, parent}).exitedWith(0));
+    EXPECT_EQ(withoutVmsnapMarks(RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", one}).standardOutput),
+              RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", parent}).standardOutput);
+    // Both in a directory: their shared memory (the memfd among it) in their pair's group.
     const fs::path pair = directory_ / "pair";
-    saved = RKRunCommand({VMSNAP_BINARY, "-o", pair.string(), parent, child});
+    RKCommandResult saved = RKRunCommand({VMSNAP_BINARY, "-o", pair.string(), parent, child});
     ASSERT_TRUE(saved.exitedWith(0)) << saved.standardError;
     std::vector<std::string> files;
     for (const auto& entry : fs::directory_iterator(pair)) files.push_back(entry.path().string());
     ASSERT_EQ(files.size(), 2u);
-    live = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", "-v", parent, child});
+    RKCommandResult live = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", "-v", parent, child});
     std::vector<std::string> arguments = {MEMSPREAD_BINARY, "-f", "bytes", "-v"};
     arguments.insert(arguments.end(), files.begin(), files.end());
-    fromFile = RKRunCommand(arguments);
+    RKCommandResult fromFile = RKRunCommand(arguments);
     ASSERT_TRUE(fromFile.exitedWith(0)) << fromFile.standardError;
+    EXPECT_NE(fromFile.standardOutput.find("[" + parent + "] (vmsnap): 64-bit"), std::string::npos);
     EXPECT_EQ(withoutVmsnapMarks(fromFile.standardOutput), live.standardOutput);
     EXPECT_NE(fromFile.standardOutput.find("memfd memspread-fixture"), std::string::npos);
 }
@@ -88,10 +84,7 @@ TEST_F(RKVmsnapEndToEnd, BadFilesAndForbiddenProcessesEndInAMessageAndStatus1) {
         std::string contents;
         std::string message;
     } cases[] = {
-        {"text", "just some text\n", "vmsnap initialization failed: not valid JSON"},
         {"truncated", good.substr(0, 40), "vmsnap initialization failed: not valid JSON"},
-        {"future", std::regex_replace(good, std::regex("\"version\":1"), "\"version\":9"),
-         "vmsnap initialization failed: unsupported version 9"},
         {"foreign", std::regex_replace(good, std::regex("Linux"), "VAX"),
          "Unable to determine platform from memory graph process description"},
     };
