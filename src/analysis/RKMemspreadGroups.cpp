@@ -32,9 +32,10 @@ RKProcessToGroupsMap RKMemspread::_generateProcessToProcessGroups() {
     }
 
     // Each object's mappers as a set of process numbers, objects in the order they are first
-    // met, so that the groups and their contents come out in the same order on every run.
+    // met, so that the groups and their contents come out in the same order on every run. The
+    // identity maps hold the objects until the groups do: the walk keeps plain pointers.
     RKProcessSetTrie sets;
-    std::vector<std::shared_ptr<RKMemoryObject>> objects;
+    std::vector<RKMemoryObject*> objects;
     std::vector<uint32_t> mappersOf;
     std::unordered_map<const RKMemoryObject*, uint32_t> indexOf;
     objects.reserve(regionCount), mappersOf.reserve(regionCount);
@@ -45,25 +46,25 @@ RKProcessToGroupsMap RKMemspread::_generateProcessToProcessGroups() {
         std::span<const std::shared_ptr<RKMemoryRegion>> regions(*process.memoryRegions());
         rk_enumerateObjectsWithBatchSize(regions, kRegionBatchSize, [&](const auto* batch, size_t count) {
             for (size_t i = 0; i < count; i++) {
-                std::shared_ptr<RKMemoryObject> object = batch[i]->memoryObject();
+                RKMemoryObject* object = batch[i]->memoryObjectPointer();
                 if (!object) continue;  // never analyzed, or released after a previous report
                 if (hidden && !hiddenProcessCounts(*object, shownPids)) continue;
                 // Met once (one region), it needs no entry in indexOf: most objects.
                 if (RKMetOnce(*object)) {
-                    objects.push_back(std::move(object)), mappersOf.push_back(sets.with(RKProcessSetTrie::kEmpty, p));
+                    objects.push_back(object), mappersOf.push_back(sets.with(RKProcessSetTrie::kEmpty, p));
                     continue;
                 }
-                auto [slot, added] = indexOf.try_emplace(object.get(), static_cast<uint32_t>(objects.size()));
-                if (added) objects.push_back(std::move(object)), mappersOf.push_back(RKProcessSetTrie::kEmpty);
+                auto [slot, added] = indexOf.try_emplace(object, static_cast<uint32_t>(objects.size()));
+                if (added) objects.push_back(object), mappersOf.push_back(RKProcessSetTrie::kEmpty);
                 mappersOf[slot->second] = sets.with(mappersOf[slot->second], p);
             }
         });
     }
     decltype(indexOf)().swap(indexOf);  // its memory, before the groups are made
-    // From here on `objects`, then the groups, hold the memory objects.
-    identityMaps_.reset();
 
     // One group a distinct set of mappers, made when its first object is met.
+    std::vector<uint32_t> objectsOf(sets.count());
+    for (uint32_t set : mappersOf) objectsOf[set]++;
     std::vector<std::shared_ptr<RKProcessGroup>> groupOf(sets.count());
     RKProcessGroupList groupsInOrder;
     for (size_t i = 0; i < objects.size(); i++) {
@@ -72,10 +73,14 @@ RKProcessToGroupsMap RKMemspread::_generateProcessToProcessGroups() {
             RKProcessGroupMinimal mappers;
             for (uint32_t p : sets.members(mappersOf[i])) mappers.addProcess(processes_[p]);
             group = mappers.immutableCopy();
+            group->reserveObjects(objectsOf[mappersOf[i]]);
             groupsInOrder.push_back(group);
         }
-        group->addObject(std::move(objects[i]));
+        group->addObject(objects[i]->shared_from_this());
     }
+    // From here on the groups hold the memory objects.
+    decltype(objects)().swap(objects);
+    identityMaps_.reset();
 
     RKProcessToGroupsMap result;
     for (const auto& group : groupsInOrder) {

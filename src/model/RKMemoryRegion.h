@@ -78,6 +78,9 @@ public:
 
     // ---- The memory object (set by the analysis; not owned) ----
     std::shared_ptr<RKMemoryObject> memoryObject() const;
+    // The same without taking a reference: for walks over every region while something else
+    // holds the objects.
+    RKMemoryObject* memoryObjectPointer() const { return memoryObject_; }
     void setMemoryObject(const std::shared_ptr<RKMemoryObject>& object) { memoryObject_ = object.get(); }
     // Called by an object that goes away, for each region it holds.
     void forgetMemoryObject(const RKMemoryObject* object) {

@@ -80,6 +80,9 @@ public:
 
     // The memory objects mapped by exactly this set of processes.
     void addObject(const std::shared_ptr<RKMemoryObject>& object) { objects_.push_back(object); }
+    // Room for `count` objects in all, when the caller knows: a list grown by adding keeps up
+    // to twice its objects' room.
+    void reserveObjects(size_t count) { objects_.reserve(count); }
     const std::vector<std::shared_ptr<RKMemoryObject>>& objects() const { return objects_; }
 
     // Caches categories for the other members of a large group; refcount > 0 or the program
