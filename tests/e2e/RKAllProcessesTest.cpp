@@ -86,7 +86,7 @@ TEST(RKAllProcesses, EveryProcessMeasuredUnderADescriptorLimitOf64AndNoNameReach
     const fs::path document = temporaryDocument("fd64");
     // Soft and hard limit alike, as `ulimit -n 64` sets them: memspread cannot raise it.
     RKCommandResult run = RKRunCommand({"prlimit", "--nofile=64:64", MEMSPREAD_BINARY, "-a", "-j", document.string()});
-    RKCommandResult refused = RKRunCommand(RKCommandAsNobody({name}));
+    RKCommandResult refused = RKRunCommand(RKAsNobody(MEMSPREAD_BINARY, {name}));
     auto measured = measuredPids(document);
     const pid_t pid = fixture.pid();
     fixture.stop();

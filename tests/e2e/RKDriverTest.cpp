@@ -208,7 +208,7 @@ TEST_F(RKDriverTest, AnUnprivilegedUser) {
     fs::permissions(json, fs::perms::all);
     for (const std::vector<std::string>& arguments :
          {std::vector<std::string>{"--unmapped", "1"}, {"-a", "-j", json}}) {
-        RKCommandResult result = RKRunCommand(RKCommandAsNobody(arguments));
+        RKCommandResult result = RKRunCommand(RKAsNobody(MEMSPREAD_BINARY, arguments));
         EXPECT_TRUE(result.exitedWith(1)) << arguments.front();
         EXPECT_EQ(result.standardError, "Must run as root.\n") << arguments.front();
         EXPECT_EQ(result.standardOutput, "") << arguments.front();
@@ -218,11 +218,11 @@ TEST_F(RKDriverTest, AnUnprivilegedUser) {
     // Another user's process is left out; without access to its executable its name comes from
     // the kernel's record.
     std::string pid = std::to_string(startSleeper("root"));
-    RKCommandResult byPid = RKRunCommand(RKCommandAsNobody({pid}));
+    RKCommandResult byPid = RKRunCommand(RKAsNobody(MEMSPREAD_BINARY, {pid}));
     EXPECT_TRUE(byPid.exitedWith(1));
     EXPECT_EQ(byPid.standardError, "task_for_pid: permission denied\nUnable to analyze process with pid " + pid +
                                        " (try as root?)\n" + kNoTarget);
-    RKCommandResult byName = RKRunCommand(RKCommandAsNobody({tag_ + "root"}));
+    RKCommandResult byName = RKRunCommand(RKAsNobody(MEMSPREAD_BINARY, {tag_ + "root"}));
     EXPECT_EQ(byName.standardError, "task_for_pid: permission denied\nUnable to analyze process " + tag_ + "root [" +
                                         pid + "] (try as root?)\n" + kNoTarget);
 }

@@ -16,7 +16,6 @@
 #include <string>
 
 #include "support/RKRunCommand.h"
-#include "support/RKUnprivileged.h"
 
 namespace fs = std::filesystem;
 
@@ -101,17 +100,6 @@ TEST(RKKernelEndToEnd, AsRootTheKernelsRegionsAddUpToItsOwnFigures) {
     for (const char* name : {"kmalloc_(large)", "KernelStack", "PageTables", "Percpu", "dentry", "Mlocked"})
         EXPECT_TRUE(map.count(std::string("category:") + name)) << name;
     EXPECT_EQ(run.standardError, "");
-}
-
-TEST(RKKernelEndToEnd, WithoutRootTheKernelIsMeminfosFiguresAndOneWarning) {
-    RKCommandResult run = RKRunCommand(RKCommandAsNobody({"-f", "bytes", "kernel"}));
-    ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
-    const std::string& out = run.standardOutput;
-    for (const char* name : {"slab (reclaimable)", "slab (unreclaimable)", "KernelStack", "PageTables", "MemTotal:"})
-        EXPECT_NE(out.find(name), std::string::npos) << name;
-    size_t first = out.find("vmalloc callers need root");
-    ASSERT_NE(first, std::string::npos) << out;
-    EXPECT_EQ(out.find("need root", first + 20), std::string::npos) << "one warning";
 }
 
 // "unattributed" is what the kernel itself leaves uncounted, give or take 1 % of MemTotal (and

@@ -114,17 +114,17 @@ TEST_F(RKVmsnapEndToEnd, BadFilesAndForbiddenProcessesEndInAMessageAndStatus1) {
     if (geteuid() != 0) GTEST_SKIP() << "the rest needs another user";
     std::string secret = file("secret", good);
     ::chmod(secret.c_str(), 0600);
-    run = RKRunCommand(RKCommandAsNobody({secret}));
+    run = RKRunCommand(RKAsNobody(MEMSPREAD_BINARY, {secret}));
     EXPECT_TRUE(run.exitedWith(1));
     EXPECT_NE(run.standardError.find("Error opening vmsnap " + secret + ": Permission denied"), std::string::npos)
         << run.standardError;
     const std::string target = (directory_ / "init.vmsnap").string();
-    run = RKRunCommand(RKVmsnapCommandAsNobody({"-o", target, "1"}));
+    run = RKRunCommand(RKAsNobody(VMSNAP_BINARY, {"-o", target, "1"}));
     EXPECT_TRUE(run.exitedWith(1));
     EXPECT_NE(run.standardError.find("Unable to analyze process with pid 1 (try as root?)"), std::string::npos)
         << run.standardError;
     EXPECT_FALSE(fs::exists(target));
-    run = RKRunCommand(RKVmsnapCommandAsNobody({"-a", "-o", directory_.string()}));
+    run = RKRunCommand(RKAsNobody(VMSNAP_BINARY, {"-a", "-o", directory_.string()}));
     EXPECT_TRUE(run.exitedWith(1));
     EXPECT_EQ(run.standardError, "vmsnap: -a needs root\n");
 }
