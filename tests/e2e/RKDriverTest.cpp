@@ -35,6 +35,12 @@ RKCommandResult memspread(std::vector<std::string> arguments) {
     return RKRunCommand(arguments);
 }
 
+// Every `from` in `text` replaced by `to`.
+std::string replaced(std::string text, const std::string& from, const std::string& to) {
+    for (size_t at = 0; (at = text.find(from, at)) != std::string::npos; at += to.size()) text.replace(at, from.size(), to);
+    return text;
+}
+
 class RKDriverTest : public ::testing::Test {
 protected:
     void SetUp() override {
@@ -79,12 +85,12 @@ protected:
     pid_t startSleeper(const std::string& suffix) { return start({sleeper(suffix), "300"}); }
 
     // Resolves a command line (without the program name) in this process, on the real /proc.
-    Keys resolve(std::vector<std::string> arguments, RKError* error = nullptr) {
+    Keys resolve(std::vector<std::string> arguments) {
         RKScopedPlatform scope(std::make_shared<RKLinuxPlatform>());
         std::vector<char*> argv = RKKeptArgv(std::move(arguments));
         auto args = RKMemspreadArgs::initWithArgc(static_cast<int>(argv.size() - 1), argv.data());
         Keys keys;
-        for (const auto& [key, process] : args.value().targetProcessesAndError(error).value_or(RKTargetMap{}))
+        for (const auto& [key, process] : args.value().targetProcessesAndError(nullptr).value_or(RKTargetMap{}))
             if (key != 0 || std::dynamic_pointer_cast<RKKernelProcess>(process)) keys.insert(key);
         return keys;
     }
@@ -105,14 +111,14 @@ TEST_F(RKDriverTest, WhatTheCommandLineAloneDecides) {
         if (line.empty() || line[0] == '#') continue;
         expected += line + "\n";
         if (line[0] != '$') continue;
-        std::istringstream words(line.substr(1));
+        std::istringstream words(replaced(line.substr(1), "@DATA@", MEMSPREAD_TEST_DATA));
         std::vector<std::string> arguments;
         for (std::string word; words >> word;) arguments.push_back(word);
         RKCommandResult result = memspread(arguments);
         actual += line + "\nexit " + std::to_string(result.exitStatus.value_or(-1));
         actual += result.standardOutput == usage ? " usage\n" : result.standardOutput.empty() ? "\n" : " other\n";
-        if (result.standardError.rfind(MEMSPREAD_BINARY, 0) == 0)
-            result.standardError.replace(0, sizeof MEMSPREAD_BINARY - 1, "memspread");
+        for (const auto& [path, name] : {std::pair{MEMSPREAD_BINARY, "memspread"}, {MEMSPREAD_TEST_DATA, "@DATA@"}})
+            result.standardError = replaced(result.standardError, path, name);
         for (const std::string& error : RKSplitLines(result.standardError))
             actual += (error.empty() ? "|" : "| " + error) + "\n";
         if (!result.standardError.empty() && result.standardError.back() != '\n') actual += "(no final newline)\n";
@@ -156,11 +162,6 @@ TEST_F(RKDriverTest, NamesFollowTheExecutableAndMatchExactly) {
     pid_t second = startSleeper("twin");
     EXPECT_EQ(resolve({tag_ + "twin"}), (Keys{first, second}));
     EXPECT_EQ(resolve({tag_ + "twi"}), Keys{}) << "no prefix matching";
-    RKError error;
-    EXPECT_EQ(resolve({tag_ + "TWIN"}, &error), Keys{});
-    EXPECT_EQ(error.localizedDescription, "Unable to find pid for process matching '" + tag_ + "TWIN'");
-    EXPECT_EQ(resolve({"0"}), Keys{0});
-    EXPECT_EQ(resolve({"kernel"}), Keys{0});
 
     pid_t deleted = startSleeper("gone");
     pid_t renamed = startSleeper("before");
@@ -170,7 +171,7 @@ TEST_F(RKDriverTest, NamesFollowTheExecutableAndMatchExactly) {
     EXPECT_EQ(resolve({tag_ + "gone", tag_ + "after", tag_ + " a ) b"}), (Keys{deleted, renamed, spaced}));
 }
 
-TEST_F(RKDriverTest, ChildrenExclusionsAndSelf) {
+TEST_F(RKDriverTest, ChildrenAndSelf) {
     // shell -> leaf -> leaf: the subshell starts the grandchild, then becomes the child.
     pid_t root = start({"/bin/sh", "-c", "(\"$0\" 300 & exec \"$0\" 300) & wait", sleeper("leaf")});
     Keys tree;
@@ -179,9 +180,6 @@ TEST_F(RKDriverTest, ChildrenExclusionsAndSelf) {
     ASSERT_EQ(tree.size(), 2u);
     tree.insert(root);
     EXPECT_EQ(resolve({"-t", std::to_string(root)}), tree);
-    // -x takes a named target away, but not a descendant that -t brings back.
-    EXPECT_EQ(resolve({tag_ + "leaf", "-x", tag_ + "leaf"}), Keys{});
-    EXPECT_EQ(resolve({"-t", std::to_string(root), "-x", tag_ + "leaf"}), tree);
 
     // memspread is never its own target: not by pid, and not with -a.
     EXPECT_EQ(resolve({"--pid", std::to_string(getpid())}), Keys{});
