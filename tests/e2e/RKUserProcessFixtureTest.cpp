@@ -128,12 +128,12 @@ TEST(RKUserProcessFixture, ReportShowsSharedMemoryOnceTheDocumentAgreesAndAllPro
         const char* kind;
         uint64_t inEachBlock, inSummary;
     } sharedKinds[] = {{"memfd", 16 * P, 32 * P}, {"shared anonymous", 16 * P, 16 * P}, {"SysV shared memory", 16 * P, 16 * P}};
-    auto summary = RKDirtyByCategory(report, "Summary Memspread: ");
-    uint64_t once = RKDirtyByCategory(report, "Shared with ")["TOTAL"];  // each process's own, plus this once
+    auto summary = RKColumnByCategory(report, "Summary Memspread: ");
+    uint64_t once = RKColumnByCategory(report, "Shared with ")["TOTAL"];  // each process's own, plus this once
     for (const std::string& header : {"[" + parent + "]: 64-bit", "[" + child + "]: 64-bit"}) {
         SCOPED_TRACE(header);
-        auto own = RKDirtyByCategory(report, header);
-        auto shared = RKDirtyByCategory(report, "Shared with ", report.find(header));
+        auto own = RKColumnByCategory(report, header);
+        auto shared = RKColumnByCategory(report, "Shared with ", report.find(header));
         for (const auto& expected : sharedKinds) {
             EXPECT_EQ(shared[expected.kind], expected.inEachBlock) << expected.kind;
             EXPECT_EQ(own.count(expected.kind), 0u) << expected.kind << " is not the process's alone";
@@ -188,7 +188,7 @@ TEST(RKUserProcessFixture, WithoutRootTheMemfdCountsOnceAndOneWarningBoundsShare
     RKCommandResult run = RKRunCommand(
         RKAsNobody(MEMSPREAD_BINARY, {"-f", "bytes", std::to_string(fixture.pid()), std::to_string(fixture.childPid())}));
     ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
-    EXPECT_EQ(RKDirtyByCategory(run.standardOutput, "Summary Memspread: ")["memfd"], 32 * P) << run.standardOutput;
+    EXPECT_EQ(RKColumnByCategory(run.standardOutput, "Summary Memspread: ")["memfd"], 32 * P) << run.standardOutput;
     const uint64_t bound = RKKernelSharedAnonymous(fixture.pid()) + RKKernelSharedAnonymous(fixture.childPid());
     EXPECT_GT(bound, 16 * P);
     EXPECT_NE(run.standardError.find("memspread: " + std::to_string(bound) + " bytes of anonymous memory are shared"),
