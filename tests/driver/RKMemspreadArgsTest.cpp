@@ -6,7 +6,6 @@
 #include <string>
 #include <vector>
 
-#include "driver/RKMemspreadArgs.h"
 #include "support/RKKeptArgv.h"
 
 namespace {
@@ -20,10 +19,9 @@ struct Parsed {
 // Parses `memspread <arguments>` in-process, capturing what the parser printed. A parser that
 // does not reset getopt must then misread the next line rather than read freed memory.
 Parsed parse(std::vector<std::string> arguments) {
-    std::vector<char*> argv = RKKeptArgv(std::move(arguments));
     Parsed parsed;
     testing::internal::CaptureStderr();
-    parsed.args = RKMemspreadArgs::initWithArgc(static_cast<int>(argv.size() - 1), argv.data(), &parsed.error);
+    parsed.args = RKParsedArgs(std::move(arguments), &parsed.error);
     parsed.standardError = testing::internal::GetCapturedStderr();
     return parsed;
 }
