@@ -1,16 +1,17 @@
 #!/usr/bin/env bash
 # What reading a process with a sparse terabyte costs: memspread's peak memory and CPU on the
-# sparse fixture (1 TiB private and 1 TiB shared anonymous, a few pages written, forked), against
-# the floor of reading the pair's smaps once.
+# sparse load (bench/sparse-load.cc: 1 TiB private and 1 TiB shared anonymous, a few pages
+# written, forked), against the floor of reading the pair's smaps once.
 #
-# Usage: bench/sparse-pages.sh BUILD_DIR [RUNS]   (a tree configured with -DMEMSPREAD_TESTS=ON)
+# Usage: bench/sparse-pages.sh BUILD_DIR [RUNS]
 set -euo pipefail
 build=${1:?usage: bench/sparse-pages.sh BUILD_DIR [RUNS]}
 runs=${2:-3}
-fixture=$build/tests/memspread_sparse_fixture
 memspread=$build/src/memspread
 scratch=$(mktemp -d)
 trap 'exec 3>&- 2>/dev/null || true; wait 2>/dev/null || true; rm -rf "$scratch"' EXIT
+fixture=$scratch/sparse-load
+c++ -O2 -std=c++20 -Wall -o "$fixture" "$(dirname "${BASH_SOURCE[0]}")/sparse-load.cc"
 
 # The fixture lives until its standard input closes: fd 3 holds the pipe open.
 exec 3> >("$fixture" >"$scratch/fixture")

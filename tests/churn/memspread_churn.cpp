@@ -8,12 +8,11 @@
 // Usage: memspread_churn            (the churning parent)
 //        memspread_churn --child    (what its exec'ing children run: map, touch, thread, exit)
 #include <poll.h>
-#include <signal.h>
 #include <sys/mman.h>
 #include <sys/wait.h>
-#include <time.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <csignal>
 #include <cstdio>
@@ -24,67 +23,25 @@
 namespace {
 
 using Clock = std::chrono::steady_clock;
-
 constexpr size_t kMapSize = 1 << 20;
 constexpr size_t kMaxLiving = 96;
-constexpr auto kZombieTime = std::chrono::milliseconds(20);  // how long an exited child stays unreaped
-constexpr auto kBatchInterval = std::chrono::milliseconds(10);
-constexpr int kBatchSize = 3;  // three children per 10 ms: 300 a second
-
 volatile std::sig_atomic_t gStop = 0;
 
-void sleepFor(std::chrono::microseconds time) {
-    timespec ts{static_cast<time_t>(time.count() / 1000000), static_cast<long>(time.count() % 1000000 * 1000)};
-    nanosleep(&ts, nullptr);
-}
-
 // Maps and dirties memory, touches it from a second thread, lingers a moment, and exits.
-[[noreturn]] void shortLife(std::chrono::microseconds linger) {
+[[noreturn]] void shortLife(std::chrono::milliseconds linger) {
     void* memory = mmap(nullptr, kMapSize, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
     if (memory != MAP_FAILED) {
         std::memset(memory, 1, kMapSize / 2);
-        std::thread toucher([memory] { std::memset(static_cast<char*>(memory) + kMapSize / 2, 2, kMapSize / 2); });
-        toucher.join();
+        std::thread([memory] { std::memset(static_cast<char*>(memory) + kMapSize / 2, 2, kMapSize / 2); }).join();
     }
-    sleepFor(linger);
+    std::this_thread::sleep_for(linger);
     _exit(0);
 }
 
-struct Child {
-    pid_t pid;
-    Clock::time_point born;
-};
-
 bool stdinClosed() {
     pollfd input{STDIN_FILENO, POLLIN, 0};
-    if (poll(&input, 1, 0) <= 0) return false;
     char byte;
-    return read(STDIN_FILENO, &byte, 1) <= 0;
-}
-
-void spawn(const char* self, unsigned serial, std::deque<Child>& children) {
-    pid_t pid = fork();
-    if (pid < 0) return;  // the system is short of processes: try again next batch
-    if (pid == 0) {
-        switch (serial % 3) {
-            case 0: shortLife(std::chrono::milliseconds(3));
-            case 1: execl(self, self, "--child", static_cast<char*>(nullptr)); _exit(127);
-            default: _exit(0);  // exits at once: a zombie until reaped
-        }
-    }
-    children.push_back({pid, Clock::now()});
-}
-
-// Reaps the children old enough, and the oldest ones when too many live.
-void reap(std::deque<Child>& children) {
-    const auto now = Clock::now();
-    while (!children.empty() && (now - children.front().born > kZombieTime || children.size() > kMaxLiving)) {
-        int status = 0;
-        bool tooMany = children.size() > kMaxLiving;
-        pid_t done = waitpid(children.front().pid, &status, tooMany ? 0 : WNOHANG);
-        if (done == 0) break;  // still running: reaped on a later pass
-        children.pop_front();
-    }
+    return poll(&input, 1, 0) > 0 && read(STDIN_FILENO, &byte, 1) <= 0;
 }
 
 }  // namespace
@@ -93,23 +50,31 @@ int main(int argc, char** argv) {
     if (argc > 1 && std::strcmp(argv[1], "--child") == 0) shortLife(std::chrono::milliseconds(2));
     std::signal(SIGTERM, [](int) { gStop = 1; });
     std::signal(SIGPIPE, SIG_IGN);
-    std::deque<Child> children;
+    std::deque<std::pair<pid_t, Clock::time_point>> children;
     std::printf("ready\n");
     std::fflush(stdout);
     unsigned serial = 0;
-    auto next = Clock::now();
-    while (!gStop && !stdinClosed()) {
-        for (int i = 0; i < kBatchSize; i++) spawn(argv[0], serial++, children);
-        reap(children);
-        next += kBatchInterval;
-        auto now = Clock::now();
-        if (next > now)
-            sleepFor(std::chrono::duration_cast<std::chrono::microseconds>(next - now));
-        else
-            next = now;  // behind: do not try to catch up in a burst
+    // Three children every 10 ms: one maps and threads, one execs, one exits at once and stays a
+    // zombie until reaped 20 ms later (or sooner, when too many live).
+    for (auto next = Clock::now(); !gStop && !stdinClosed();) {
+        for (int i = 0; i < 3; i++, serial++) {
+            pid_t pid = fork();
+            if (pid == 0 && serial % 3 == 0) shortLife(std::chrono::milliseconds(3));
+            if (pid == 0 && serial % 3 == 1) execl(argv[0], argv[0], "--child", static_cast<char*>(nullptr));
+            if (pid == 0) _exit(0);
+            if (pid > 0) children.emplace_back(pid, Clock::now());  // else short of processes: next time
+        }
+        while (!children.empty() && (Clock::now() - children.front().second > std::chrono::milliseconds(20) ||
+                                     children.size() > kMaxLiving)) {
+            if (waitpid(children.front().first, nullptr, children.size() > kMaxLiving ? 0 : WNOHANG) == 0) break;
+            children.pop_front();
+        }
+        // Behind: do not try to catch up in a burst.
+        next = std::max(next + std::chrono::milliseconds(10), Clock::now());
+        std::this_thread::sleep_until(next);
     }
-    for (const Child& child : children) kill(child.pid, SIGKILL);
-    for (const Child& child : children) waitpid(child.pid, nullptr, 0);
+    for (const auto& child : children) kill(child.first, SIGKILL);
+    for (const auto& child : children) waitpid(child.first, nullptr, 0);
     std::fprintf(stderr, "memspread_churn: %u processes started\n", serial);
     return 0;
 }

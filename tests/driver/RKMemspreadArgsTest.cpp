@@ -1,11 +1,11 @@
-// The command-line parser, in-process. The messages of the binary and the usage text are checked
-// end to end; here: what the options set, which errors win, and getopt's state between parses.
+// The command-line parser, in-process. The refusals, their messages and which error wins are
+// checked end to end (tests/data/driver-failures.txt); here: what the options set, the checks
+// after parsing, and getopt's state between parses.
 #include <gtest/gtest.h>
 
 #include <string>
 #include <vector>
 
-#include "driver/RKMemspreadArgs.h"
 #include "support/RKKeptArgv.h"
 
 namespace {
@@ -19,10 +19,9 @@ struct Parsed {
 // Parses `memspread <arguments>` in-process, capturing what the parser printed. A parser that
 // does not reset getopt must then misread the next line rather than read freed memory.
 Parsed parse(std::vector<std::string> arguments) {
-    std::vector<char*> argv = RKKeptArgv(std::move(arguments));
     Parsed parsed;
     testing::internal::CaptureStderr();
-    parsed.args = RKMemspreadArgs::initWithArgc(static_cast<int>(argv.size() - 1), argv.data(), &parsed.error);
+    parsed.args = RKParsedArgs(std::move(arguments), &parsed.error);
     parsed.standardError = testing::internal::GetCapturedStderr();
     return parsed;
 }
@@ -57,26 +56,6 @@ TEST(RKMemspreadArgs, TargetsFromOptionsAndPermutedPositionals) {
     EXPECT_EQ(args.excludedPidsOrProcesses(), (std::set<std::string>{"3", "panel"}));
 }
 
-// The binary's tests check the descriptions of the common refusals; these are the codes, the
-// refusals that are easy to get wrong, and which error wins when several are on one line.
-TEST(RKMemspreadArgs, RefusedCommandLinesStopAtTheFirstError) {
-    const std::vector<std::pair<std::vector<std::string>, int64_t>> cases = {
-        {{"--sort", "Dirt"}, RKMemspreadErrorSort},  // no prefixes
-        {{"--sample", "nan"}, RKMemspreadErrorSample},
-        {{"--sample", "1e-310"}, RKMemspreadErrorSample},  // subnormal
-        {{"-h", "--sort", "bad", "-q"}, RKMemspreadErrorHelp},
-        {{"--sort", "bad", "-h"}, RKMemspreadErrorSort},
-        {{"--bogus"}, RKMemspreadErrorOption},
-    };
-    for (const auto& [arguments, code] : cases) {
-        Parsed parsed = parse(arguments);
-        EXPECT_FALSE(parsed.args) << arguments.front();
-        EXPECT_EQ(parsed.error.code, code) << arguments.front();
-        bool described = code != RKMemspreadErrorHelp && code != RKMemspreadErrorOption;
-        EXPECT_EQ(parsed.error.localizedDescription.has_value(), described) << arguments.front();
-    }
-}
-
 TEST(RKMemspreadArgs, ChecksAfterParsingClearUnmapped) {
     const std::string warning =
         "WARNING: ignoring '--unmapped' because the requested analysis mode '--vmObjectDirty' does not "
@@ -87,8 +66,6 @@ TEST(RKMemspreadArgs, ChecksAfterParsingClearUnmapped) {
     Parsed all = parse({"-a", "--unmapped"});
     EXPECT_FALSE(all.args->searchForUnmapped());
     EXPECT_EQ(all.standardError, "NOTICE: '--unmapped' is redundant when using -a/--all\n");
-    EXPECT_EQ(parse({"--vmObjectDirty", "--unmapped", "-f", "bad"}).standardError, "")
-        << "checks run only when the options ended normally";
 }
 
 // Regression: getopt keeps its position (and its place inside "-af") between calls; a parse that

@@ -17,16 +17,6 @@ namespace {
 
 constexpr uint64_t kSecond = 1000000000;
 
-// The arguments record of `memspread <arguments>`.
-RKMemspreadArgs argsFor(std::vector<std::string> arguments) {
-    std::vector<char*> argv = RKKeptArgv(std::move(arguments));
-    RKError error;
-    std::optional<RKMemspreadArgs> args =
-        RKMemspreadArgs::initWithArgc(static_cast<int>(argv.size() - 1), argv.data(), &error);
-    EXPECT_TRUE(args.has_value()) << error.localizedDescription.value_or("");
-    return std::move(*args);
-}
-
 // Counts the reports it is given. Closed, it holds the first report back until opened, so that the
 // sample stays in analysis while the next ones are gathered.
 class GatedFormatter : public RKRecordingFormatter {
@@ -89,7 +79,7 @@ TEST(RKSampler, SlowSamplesStretchTheIntervalOnceWithAWarning) {
     RKScriptedProcess& slow = s.platform->addProcess(100, "slow");
     slow.walkNanoseconds = 5 * kSecond / 2;
     slow.physMemspreadGrowth = 4096;  // never carried over: every sample gathers it
-    RKMemspreadArgs args = argsFor({"--sample", "1", "100"});
+    RKMemspreadArgs args = *RKParsedArgs({"--sample", "1", "100"});
 
     testing::internal::CaptureStderr();
     {
@@ -111,7 +101,7 @@ TEST(RKSampler, AnUnchangedProcessIsCarriedOverWhileItsSampleIsStillInAnalysis) 
     s.platform->addProcess(100, "lowest");  // never carried over: a cancelled gather writes into it
     s.platform->addProcess(200, "steady");
     s.platform->addProcess(300, "growing").physMemspreadGrowth = 4096;
-    RKMemspreadArgs args = argsFor({"--sample", "0.5", "100", "200", "300"});
+    RKMemspreadArgs args = *RKParsedArgs({"--sample", "0.5", "100", "200", "300"});
 
     testing::internal::CaptureStderr();  // "Stopping..."
     RKSampler sampler(args, s.formatters);

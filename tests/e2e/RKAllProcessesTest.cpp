@@ -6,10 +6,13 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstdlib>
 #include <filesystem>
+#include <iterator>
 #include <set>
+#include <sstream>
 #include <string>
 #include <vector>
 
@@ -22,50 +25,32 @@ using namespace std::chrono_literals;
 
 namespace {
 
-// Prints the pid of every process object of the document that carries a memspread figure.
-const char* kMeasuredPids = R"(import json, sys
-document = json.load(open(sys.argv[1], encoding="utf-8"))
-for process in document["processes"]:
-    if "memspread" in process: print(process["pid"])
-)";
-
 fs::path temporaryDocument(const std::string& name) {
     return fs::temp_directory_path() / ("rk-" + name + "-" + std::to_string(getpid()) + ".json");
 }
 
-// The pids of the measured processes in `document`, or nothing when it does not parse.
+// The pids of the processes in `document` that carry a memspread figure; nothing when it does not parse.
 std::optional<std::set<pid_t>> measuredPids(const fs::path& document) {
-    RKCommandResult parsed = RKRunCommand({"python3", "-c", kMeasuredPids, document.string()});
-    if (!parsed.exitedWith(0)) return std::nullopt;
-    std::set<pid_t> pids;
-    for (const std::string& line : RKSplitLines(parsed.standardOutput)) pids.insert(std::stoi(line));
-    return pids;
+    RKCommandResult parsed = RKRunCommand({"python3", "-c",
+                                           "import json, sys; print(*[p['pid'] for p in json.load(open(sys.argv[1]))"
+                                           "['processes'] if 'memspread' in p])",
+                                           document.string()});
+    std::istringstream words(parsed.standardOutput);
+    return parsed.exitedWith(0) ? std::optional(std::set<pid_t>(std::istream_iterator<pid_t>(words), {})) : std::nullopt;
 }
 
 // Idle children of the test, killed and reaped when it ends.
-class RKIdleChildren {
-public:
-    explicit RKIdleChildren(int count) {
-        for (int i = 0; i < count; i++) {
-            pid_t pid = fork();
-            if (pid == 0) {
-                for (;;) pause();
-            }
-            if (pid > 0) pids.push_back(pid);
-        }
-    }
+struct RKIdleChildren {
+    std::vector<pid_t> pids;
     ~RKIdleChildren() {
         for (pid_t pid : pids) kill(pid, SIGKILL);
         for (pid_t pid : pids) waitpid(pid, nullptr, 0);
     }
-    std::vector<pid_t> pids;
 };
 
 // A byte that a terminal could act on, other than the line ends and tabs of the report itself.
 bool hasRawControl(const std::string& text) {
-    for (unsigned char byte : text)
-        if ((byte < 0x20 && byte != '\n' && byte != '\t') || byte == 0x7F) return true;
-    return false;
+    return std::ranges::any_of(text, [](unsigned char c) { return (c < 0x20 && c != '\n' && c != '\t') || c == 0x7F; });
 }
 
 }  // namespace
@@ -81,12 +66,16 @@ TEST(RKAllProcesses, EveryProcessMeasuredUnderADescriptorLimitOf64AndNoNameReach
     fs::copy_file(MEMSPREAD_FIXTURE, directory / name);
     RKFixtureProcess fixture;
     ASSERT_TRUE(fixture.start((directory / name).string(), {directory.string()})) << fixture.error();
-    RKIdleChildren children(300);
+    RKIdleChildren children;
+    for (pid_t pid = 0; children.pids.size() < 300 && (pid = fork()) >= 0;) {
+        if (pid == 0) for (;;) pause();  // until killed
+        children.pids.push_back(pid);
+    }
     ASSERT_EQ(children.pids.size(), 300u);
     const fs::path document = temporaryDocument("fd64");
     // Soft and hard limit alike, as `ulimit -n 64` sets them: memspread cannot raise it.
     RKCommandResult run = RKRunCommand({"prlimit", "--nofile=64:64", MEMSPREAD_BINARY, "-a", "-j", document.string()});
-    RKCommandResult refused = RKRunCommand(RKCommandAsNobody({name}));
+    RKCommandResult refused = RKRunCommand(RKAsNobody(MEMSPREAD_BINARY, {name}));
     auto measured = measuredPids(document);
     const pid_t pid = fixture.pid();
     fixture.stop();

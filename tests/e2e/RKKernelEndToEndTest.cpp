@@ -9,41 +9,24 @@
 
 #include <algorithm>
 #include <cmath>
-#include <filesystem>
 #include <fstream>
 #include <map>
-#include <sstream>
 #include <string>
 
+#include "support/RKReportRows.h"
 #include "support/RKRunCommand.h"
-#include "support/RKUnprivileged.h"
-
-namespace fs = std::filesystem;
 
 namespace {
 
-// "NAME VALUE" lines: the kernel's dirty + reclaimable bytes ("kernel"), its reclaimable bytes,
-// its category names ("category:NAME"), and each term of the system map ("system:NAME").
-const char* kSummarizeDocument = R"(import json, sys
-document = json.load(open(sys.argv[1], encoding="utf-8"))
-kernel = next(p for p in document["processes"] if p["pid"] == 0)
-print("kernel", sum(c["dirty"] + c["reclaimable"] for c in kernel["categories"].values()))
-print("reclaimable", sum(c["reclaimable"] for c in kernel["categories"].values()))
-for name in kernel["categories"]: print("category:" + name.replace(" ", "_"), 1)
-for name, value in ((document.get("auxiliary") or {}).get("system") or {}).items(): print("system:" + name.replace(" ", "_"), value)
-)";
-
-std::map<std::string, int64_t> figures(const RKCommandResult& run, const fs::path& document) {
-    RKCommandResult parsed = RKRunCommand({"python3", "-c", kSummarizeDocument, document.string()});
-    fs::remove(document);
-    EXPECT_TRUE(run.exitedWith(0)) << run.standardError;
-    EXPECT_TRUE(parsed.exitedWith(0)) << parsed.standardError;
-    std::map<std::string, int64_t> result;
-    std::istringstream words(parsed.standardOutput);
-    std::string name;
-    int64_t value = 0;
-    while (words >> name >> value) result[name] = value;
-    return result;
+// The terms of the system map that ends a report of every process, by name.
+std::map<std::string, int64_t> systemMap(const std::string& report) {
+    std::map<std::string, int64_t> terms;
+    const auto lines = RKSplitLines(report.substr(std::min(report.find("\n\tsystem:\n"), report.size())));
+    for (size_t i = 2; i < lines.size() && lines[i].starts_with("\t\t"); i++) {
+        const size_t colon = lines[i].find(": ");
+        terms[lines[i].substr(2, colon - 2)] = std::stoll(lines[i].substr(colon + 2));
+    }
+    return terms;
 }
 
 std::map<std::string, int64_t> meminfo() {
@@ -85,40 +68,29 @@ void expectBetween(int64_t value, int64_t before, int64_t after, int64_t below, 
 
 TEST(RKKernelEndToEnd, AsRootTheKernelsRegionsAddUpToItsOwnFigures) {
     if (geteuid() != 0) GTEST_SKIP() << "the slab caches and vmalloc callers need root";
-    const fs::path document = fs::temp_directory_path() / ("rkkernel-" + std::to_string(getpid()) + ".json");
     auto kernelFigure = [](std::map<std::string, int64_t> info) {
         return info["Slab"] + info["KernelStack"] + info["PageTables"] + info["SecPageTables"] + info["Percpu"] +
                info["VmallocUsed"] - std::min(vmallocStacks(), info["KernelStack"]);
     };
     const int64_t before = kernelFigure(meminfo());
-    RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", "-j", document.string(), "kernel"});
+    RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", "kernel"});
     const int64_t after = kernelFigure(meminfo());
-    auto map = figures(run, document);
+    ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
+    EXPECT_EQ(run.standardError, "");
+    auto dirty = RKColumnByCategory(run.standardOutput, "kernel [0]: 64-bit");
+    auto reclaimable = RKColumnByCategory(run.standardOutput, "kernel [0]: 64-bit", 0, 2);
 
     const int64_t onePercent = std::max(before, after) / 100;
-    expectBetween(map["kernel"], before, after, onePercent, onePercent);
-    EXPECT_GT(map["reclaimable"], 0) << "the collectable caches (dentry, inodes) hold reclaimable memory";
-    for (const char* name : {"kmalloc_(large)", "KernelStack", "PageTables", "Percpu", "dentry", "Mlocked"})
-        EXPECT_TRUE(map.count(std::string("category:") + name)) << name;
-    EXPECT_EQ(run.standardError, "");
-}
-
-TEST(RKKernelEndToEnd, WithoutRootTheKernelIsMeminfosFiguresAndOneWarning) {
-    RKCommandResult run = RKRunCommand(RKCommandAsNobody({"-f", "bytes", "kernel"}));
-    ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
-    const std::string& out = run.standardOutput;
-    for (const char* name : {"slab (reclaimable)", "slab (unreclaimable)", "KernelStack", "PageTables", "MemTotal:"})
-        EXPECT_NE(out.find(name), std::string::npos) << name;
-    size_t first = out.find("vmalloc callers need root");
-    ASSERT_NE(first, std::string::npos) << out;
-    EXPECT_EQ(out.find("need root", first + 20), std::string::npos) << "one warning";
+    expectBetween(static_cast<int64_t>(dirty["TOTAL"] + reclaimable["TOTAL"]), before, after, onePercent, onePercent);
+    EXPECT_GT(reclaimable["TOTAL"], 0u) << "the collectable caches (dentry, inodes) hold reclaimable memory";
+    for (const char* name : {"kmalloc (large)", "KernelStack", "PageTables", "Percpu", "dentry", "Mlocked"})
+        EXPECT_TRUE(dirty.count(name)) << name;
 }
 
 // "unattributed" is what the kernel itself leaves uncounted, give or take 1 % of MemTotal (and
 // memspread's own memory), and at most that when the machine is quiet.
 TEST(RKKernelEndToEnd, TheSystemMapAccountsForEveryByteOfTheMachine) {
     if (geteuid() != 0) GTEST_SKIP() << "-a needs root";
-    const fs::path document = fs::temp_directory_path() / ("rkkernel-" + std::to_string(getpid()) + ".json");
     // What the kernel itself leaves uncounted: MemTotal less free memory and every kind of
     // /proc/meminfo. Little on a quiet machine, hundreds of MiB while compilers come and go.
     auto uncountedBy = [](std::map<std::string, int64_t> info) {
@@ -129,23 +101,23 @@ TEST(RKKernelEndToEnd, TheSystemMapAccountsForEveryByteOfTheMachine) {
         return uncounted;
     };
     const int64_t before = uncountedBy(meminfo());
-    RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, "-a", "-f", "bytes", "-j", document.string()});
+    RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, "-a", "-f", "bytes"});
     const int64_t own = largestChildResident();
     const int64_t after = uncountedBy(meminfo());
-    auto map = figures(run, document);
+    ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
+    auto map = systemMap(run.standardOutput);
     // The map adds up to MemTotal exactly.
     int64_t sum = 0;
-    for (const char* term : {"free", "processes", "kernel", "page_cache_(not_mapped)", "huge_pages_(free)",
-                             "compressed_swap_pool", "unattributed"}) {
-        EXPECT_TRUE(map.count(std::string("system:") + term)) << term;
-        sum += map[std::string("system:") + term];
+    for (const char* term : {"free", "processes", "kernel", "page cache (not mapped)", "huge pages (free)",
+                             "compressed swap pool", "unattributed"}) {
+        EXPECT_TRUE(map.count(term)) << term;
+        sum += map[term];
     }
-    EXPECT_GT(map["system:MemTotal"], 0);
-    EXPECT_EQ(sum, map["system:MemTotal"]);
-    const int64_t unattributed = map["system:unattributed"];
-    const int64_t onePercent = map["system:MemTotal"] / 100;
+    EXPECT_GT(map["MemTotal"], 0);
+    EXPECT_EQ(sum, map["MemTotal"]);
+    const int64_t unattributed = map["unattributed"];
+    const int64_t onePercent = map["MemTotal"] / 100;
     expectBetween(unattributed, before, after, onePercent, onePercent + own);
     EXPECT_TRUE(std::max(before, after) >= onePercent / 2 || std::llabs(unattributed) <= onePercent + own)
         << unattributed;
-    EXPECT_NE(run.standardOutput.find("\tsystem:\n\t\tMemTotal: "), std::string::npos);
 }

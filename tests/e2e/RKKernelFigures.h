@@ -3,6 +3,7 @@
 #pragma once
 #include <sys/types.h>
 
+#include <algorithm>
 #include <cstdint>
 #include <cstdio>
 #include <fstream>
@@ -27,6 +28,13 @@ inline uint64_t RKKernelMemspread(pid_t pid) {
     return RKKernelField(pid, "status", "RssAnon") + RKKernelField(pid, "status", "RssShmem") +
            RKKernelField(pid, "status", "VmSwap") + RKKernelField(pid, "status", "VmPTE") -
            RKKernelField(pid, "smaps_rollup", "LazyFree");
+}
+
+// Anonymous pages (private copies in file mappings too) `pid` shares with one other process, as
+// after a fork: each is whole in Anonymous and half in Pss_Anon.
+inline uint64_t RKKernelSharedAnonymous(pid_t pid) {
+    const uint64_t anonymous = RKKernelField(pid, "smaps_rollup", "Anonymous");
+    return 2 * (anonymous - std::min(anonymous, RKKernelField(pid, "smaps_rollup", "Pss_Anon")));
 }
 
 // The figure in the header of process `pid` of a report; 0 when the report has no such header.

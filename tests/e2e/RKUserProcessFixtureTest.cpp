@@ -1,14 +1,17 @@
 // A live process measured end to end: the fixture maps one area of each kind and forks a child
-// that shares the shared kinds. Gathered in this process, each area must come out as a region of
-// the right name, detail, share mode, identity and size; through the binary, the report must
-// show the shared kinds once, in the block of memory the two processes share, each process at
-// the kernel's own figure, and the JSON document of the same run must parse and agree with it.
+// that shares the shared kinds (of the memfd, each wrote one half). Gathered in this process,
+// each area must come out as a region of the right name, detail, share mode, identity and size,
+// its locked and lazily freed pages as the kernel counts them; through the binary, the report
+// must show the shared kinds once, in the block of memory the two processes share, each process
+// at the kernel's own figure and the anonymous memory they share since the fork once, and the
+// JSON document of the same run must parse and agree with it.
 #include <gtest/gtest.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <csignal>
 #include <filesystem>
-#include <map>
 
 #include "RKKernelFigures.h"
 #include "model/RKMemoryRegion.h"
@@ -17,6 +20,7 @@
 #include "support/RKFixtureProcess.h"
 #include "support/RKReportRows.h"
 #include "support/RKRunCommand.h"
+#include "support/RKUnprivileged.h"
 
 namespace {
 
@@ -39,6 +43,16 @@ for process in sorted(document["processes"], key=lambda p: p["pid"]): print(proc
 for record in document["shared"]: print("shared", *sorted(record["pids"]))
 )";
 
+// The process ends after its walk, before its page data is read.
+class RKExitsAfterWalk : public RKUserProcess {
+public:
+    void enumerateRegions(const RKRegionCallback& callback) override {
+        RKUserProcess::enumerateRegions(callback);
+        ::kill(pid(), SIGTERM);  // the fixture removes its files on the way out
+        ::waitpid(pid(), nullptr, 0);
+    }
+};
+
 }  // namespace
 
 TEST(RKUserProcessFixture, EveryKindOfMappingBecomesItsRegion) {
@@ -59,7 +73,7 @@ TEST(RKUserProcessFixture, EveryKindOfMappingBecomesItsRegion) {
         uint64_t dirtyPages;
         bool sharedWithChild;  // one object in both, which private anonymous memory never is
     } expectations[] = {
-        {"memfd", "memfd", "memspread-fixture", SM_SHARED, 32, true},
+        {"memfd", "memfd", "memspread-fixture", SM_SHARED, 16, true},  // the child wrote the other half
         {"shared_anon", "shared anonymous", "", SM_SHARED, 16, true},
         {"sysv", "SysV shared memory", "/SYSV00000000", SM_SHARED, 16, true},
         {"dev_shm", "POSIX shared memory", "/dev/shm/" + files, SM_SHARED, 16, false},
@@ -82,11 +96,16 @@ TEST(RKUserProcessFixture, EveryKindOfMappingBecomesItsRegion) {
         EXPECT_EQ(regionAt(*child, fixture, expected.area).object_id == region.object_id, expected.sharedWithChild);
     }
     EXPECT_EQ(regionAt(*parent, fixture, "file_private").cleanNonSpecSize, 16 * P);
-    EXPECT_TRUE(regionAt(*parent, fixture, "mlocked").wired);
+    const auto kernel = [&](const char* field, const char* area) {
+        return RKKernelField(fixture.pid(), "smaps", field, fixture.area(area)->address);
+    };
+    EXPECT_EQ(regionAt(*parent, fixture, "mlocked").wiredSize(), kernel("Locked", "mlocked"));
+    EXPECT_EQ(regionAt(*parent, fixture, "mlocked").wiredSize(), 8 * P);
     // MADV_FREE skips a page someone else holds at that moment, so a few may stay dirty.
     const RKMemoryRegion& freed = regionAt(*parent, fixture, "madv_free");
     EXPECT_EQ(freed.dirtySize + freed.reclaimableSize, 64 * P);
-    EXPECT_GE(freed.reclaimableSize, 28 * P) << "lazily freed pages are reclaimable";
+    EXPECT_EQ(freed.reclaimableSize, kernel("LazyFree", "madv_free"));
+    EXPECT_GE(freed.reclaimableSize, 28 * P);
     const RKMemoryRegion& shared = regionAt(*parent, fixture, "file_shared");
     EXPECT_EQ(shared.dirtySize + shared.cleanNonSpecSize, 8 * P) << "written pages, dirty until written back";
     EXPECT_EQ(regionAt(*parent, fixture, "heap").name, "heap");
@@ -104,28 +123,31 @@ TEST(RKUserProcessFixture, ReportShowsSharedMemoryOnceTheDocumentAgreesAndAllPro
     ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
     ASSERT_TRUE(parsed.exitedWith(0)) << "the document does not parse: " << parsed.standardError;
     const std::string& report = run.standardOutput;
-    const std::map<std::string, uint64_t> sharedKinds = {
-        {"memfd", 32 * P}, {"shared anonymous", 16 * P}, {"SysV shared memory", 16 * P}};
-    auto summary = RKDirtyByCategory(report, "Summary Memspread: ");
-    uint64_t once = RKDirtyByCategory(report, "Shared with ")["TOTAL"];  // each process's own, plus this once
+    // In each process's block the pages it maps; in the summary the object once and whole.
+    const struct {
+        const char* kind;
+        uint64_t inEachBlock, inSummary;
+    } sharedKinds[] = {{"memfd", 16 * P, 32 * P}, {"shared anonymous", 16 * P, 16 * P}, {"SysV shared memory", 16 * P, 16 * P}};
+    auto summary = RKColumnByCategory(report, "Summary Memspread: ");
+    uint64_t once = RKColumnByCategory(report, "Shared with ")["TOTAL"];  // each process's own, plus this once
     for (const std::string& header : {"[" + parent + "]: 64-bit", "[" + child + "]: 64-bit"}) {
         SCOPED_TRACE(header);
-        auto own = RKDirtyByCategory(report, header);
-        auto shared = RKDirtyByCategory(report, "Shared with ", report.find(header));
-        for (const auto& [kind, bytes] : sharedKinds) {
-            EXPECT_EQ(shared[kind], bytes) << kind;
-            EXPECT_EQ(own.count(kind), 0u) << kind << " is not the process's alone";
-            EXPECT_EQ(summary[kind], bytes) << kind;
+        auto own = RKColumnByCategory(report, header);
+        auto shared = RKColumnByCategory(report, "Shared with ", report.find(header));
+        for (const auto& expected : sharedKinds) {
+            EXPECT_EQ(shared[expected.kind], expected.inEachBlock) << expected.kind;
+            EXPECT_EQ(own.count(expected.kind), 0u) << expected.kind << " is not the process's alone";
+            EXPECT_EQ(summary[expected.kind], expected.inSummary) << expected.kind;
         }
         once += own["TOTAL"];
     }
-    EXPECT_EQ(summary["TOTAL"], once) << report;
+    EXPECT_EQ(summary["TOTAL"], once + 16 * P) << "and the memfd's other half\n" << report;
     // Each process costs what the kernel charges it (RssAnon + RssShmem + VmSwap + VmPTE − LazyFree),
     // plus the dirty pages of the file it maps shared, which the kernel leaves to the page cache.
     const uint64_t fileShared = fixture.area("file_shared")->address;
-    EXPECT_EQ(RKReportedMemspread(report, fixture.pid()),
-              RKKernelMemspread(fixture.pid()) + RKKernelField(fixture.pid(), "smaps", "Shared_Dirty", fileShared) +
-                  RKKernelField(fixture.pid(), "smaps", "Private_Dirty", fileShared));
+    const uint64_t fileSharedDirty = RKKernelField(fixture.pid(), "smaps", "Shared_Dirty", fileShared) +
+                                     RKKernelField(fixture.pid(), "smaps", "Private_Dirty", fileShared);
+    EXPECT_EQ(RKReportedMemspread(report, fixture.pid()), RKKernelMemspread(fixture.pid()) + fileSharedDirty);
     EXPECT_EQ(RKReportedMemspread(report, fixture.childPid()), RKKernelMemspread(fixture.childPid()));
 
     // The document holds each process's header figure, in pid order, and one shared record of the two.
@@ -136,11 +158,55 @@ TEST(RKUserProcessFixture, ReportShowsSharedMemoryOnceTheDocumentAgreesAndAllPro
     expected += "shared " + std::to_string(low) + " " + std::to_string(high) + "\n";
     EXPECT_TRUE(parsed.standardOutput.starts_with(expected)) << parsed.standardOutput << "expected:\n" << expected;
 
-    // As root, -a reports every process: these among them, and the kernel.
-    if (geteuid() != 0) GTEST_SKIP() << "-a needs root";
+    if (geteuid() != 0) GTEST_SKIP() << "frames and -a need root";
+    // With frames, the anonymous pages the two share since the fork count once in the summary:
+    // the kernel's Pss_Anon over both, less what it lazily frees. They are in the categories of
+    // anonymous memory, image data, and mapped files (private copies, beside file_shared's pages).
+    uint64_t pssAnon = 0;
+    for (const pid_t pid : {fixture.pid(), fixture.childPid()})
+        pssAnon += RKKernelField(pid, "smaps_rollup", "Pss_Anon") - RKKernelField(pid, "smaps_rollup", "LazyFree");
+    const uint64_t anonymous = summary["anonymous"] + summary["heap"] + summary["stack"] + summary[".data"] +
+                               summary[".data.rel.ro"] + summary["mapped file"] - fileSharedDirty;
+    EXPECT_NEAR(static_cast<double>(anonymous), static_cast<double>(pssAnon), 0.01 * static_cast<double>(pssAnon))
+        << report.substr(report.find("Summary Memspread: "));
+
+    // -a reports every process: these among them, and the kernel.
     run = RKRunCommand({MEMSPREAD_BINARY, "-a", "-f", "bytes"});
     ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
     for (const std::string& pid : {parent, child, std::to_string(getpid())})
         EXPECT_NE(run.standardOutput.find("[" + pid + "]: 64-bit\tMemspread: "), std::string::npos) << pid;
     EXPECT_NE(run.standardOutput.find("kernel [0]: 64-bit"), std::string::npos);
+}
+
+// Without root, the memfd still counts once by the pages each process maps; the anonymous pages
+// the two share since the fork cannot be told apart, and one warning bounds them.
+TEST(RKUserProcessFixture, WithoutRootTheMemfdCountsOnceAndOneWarningBoundsSharedAnonymousMemory) {
+    if (geteuid() != 0) GTEST_SKIP() << "needs root to run the fixture and the binary as nobody";
+    RKFixtureProcess fixture;
+    const std::vector<std::string> command = RKAsNobody(MEMSPREAD_FIXTURE, {"/tmp"});
+    ASSERT_TRUE(fixture.start(command[0], {command.begin() + 1, command.end()})) << fixture.error();
+    RKCommandResult run = RKRunCommand(
+        RKAsNobody(MEMSPREAD_BINARY, {"-f", "bytes", std::to_string(fixture.pid()), std::to_string(fixture.childPid())}));
+    ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
+    EXPECT_EQ(RKColumnByCategory(run.standardOutput, "Summary Memspread: ")["memfd"], 32 * P) << run.standardOutput;
+    const uint64_t bound = RKKernelSharedAnonymous(fixture.pid()) + RKKernelSharedAnonymous(fixture.childPid());
+    EXPECT_GT(bound, 16 * P);
+    EXPECT_NE(run.standardError.find("memspread: " + std::to_string(bound) + " bytes of anonymous memory are shared"),
+              std::string::npos)
+        << run.standardError;
+}
+
+TEST(RKUserProcessFixture, ProcessThatExitsBeforeItsPageQueryIsAWarning) {
+    RKFixtureProcess fixture;
+    ASSERT_TRUE(fixture.start(MEMSPREAD_FIXTURE)) << fixture.error();
+    RKAnalysisSettings::setBreakDownPhysMemspread(true);
+    auto process = std::make_shared<RKExitsAfterWalk>();
+    ASSERT_TRUE(process->initWithBsdInfo(*RKPlatform::current().bsdInfo(fixture.pid())));
+    testing::internal::CaptureStderr();
+    process->gatherData();
+    testing::internal::GetCapturedStderr();
+    ASSERT_EQ(process->warnings().size(), 1u);
+    EXPECT_TRUE(process->warnings().front().ends_with(" (process exited)")) << process->warnings().front();
+    EXPECT_TRUE(process->errors().empty());
+    EXPECT_TRUE(process->memoryRegions()) << "the run goes on with the regions of the walk";
 }

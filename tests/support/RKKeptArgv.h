@@ -3,8 +3,11 @@
 #pragma once
 
 #include <deque>
+#include <optional>
 #include <string>
 #include <vector>
+
+#include "driver/RKMemspreadArgs.h"
 
 inline std::vector<char*> RKKeptArgv(std::vector<std::string> arguments) {
     static std::deque<std::vector<std::string>> commandLines;
@@ -14,4 +17,10 @@ inline std::vector<char*> RKKeptArgv(std::vector<std::string> arguments) {
     for (std::string& argument : kept) argv.push_back(argument.data());
     argv.push_back(nullptr);
     return argv;
+}
+
+// `memspread <arguments>` parsed in-process.
+inline std::optional<RKMemspreadArgs> RKParsedArgs(std::vector<std::string> arguments, RKError* error = nullptr) {
+    std::vector<char*> argv = RKKeptArgv(std::move(arguments));
+    return RKMemspreadArgs::initWithArgc(static_cast<int>(argv.size() - 1), argv.data(), error);
 }
