@@ -1,14 +1,10 @@
-// Images: the forward-only enumerator the walk names regions with, the intern tables shared by
-// gathering threads, and the images of a process on scripted answers naming its regions.
+// Images: the forward-only enumerator the walk names regions with, and the intern tables shared
+// by gathering threads. (How images name a process's regions is in RKProcessTest.)
 #include <gtest/gtest.h>
 
 #include <thread>
 
-#include "model/RKMemoryRegion.h"
-#include "platform/RKScriptedPlatform.h"
-#include "process/RKAnalysisSettings.h"
 #include "process/RKImage.h"
-#include "process/RKUserProcess.h"
 
 namespace {
 
@@ -50,36 +46,4 @@ TEST(RKImage, InternTablesShareOneStringAcrossThreadsAndOverflowToOwnCopies) {
     EXPECT_EQ(*overflow, "e");
     EXPECT_NE(overflow.get(), table.intern("e", 0, 4, 1024).get()) << "a full table hands out copies";
     EXPECT_EQ(*table.intern("bx", 0, 4, 1), "b") << "compared on the first `limit` bytes only";
-}
-
-TEST(RKImage, ImagesOfAProcessNameItsRegions) {
-    auto platform = std::make_shared<RKScriptedPlatform>();
-    RKScopedPlatform scoped(platform);
-    auto& tool = platform->addProcess(7, "tool");
-    RKRegionSubmapInfo file;
-    file.external_pager = 1;
-    for (uint64_t start : {0x10000, 0x12000, 0x14000, 0x20000})
-        tool.regions.push_back({start, 0x2000, file, RK_REGION_SUBMAP_INFO_COUNT, VM_PURGABLE_DENY, "/bin/tool", {}});
-    // Out of order, as the Linux platform makes them: named after what each mapping holds.
-    tool.images = {
-        {"/bin/tool", 0x10000, 0x14000, 0x2000, ".data", RKSegmentData},
-        {"/bin/tool", 0x10000, 0x10000, 0x2000, ".text", RKSegmentText},
-        {"/bin/tool", 0x10000, 0x12000, 0x2000, ".rodata", RKSegmentLinkedit},
-    };
-    auto process = std::dynamic_pointer_cast<RKUserProcess>(RKProcess::processWithPid(7));
-    ASSERT_TRUE(process);
-    process->gatherData();
-    const auto& regions = *process->memoryRegions();
-    ASSERT_EQ(regions.size(), 4u);
-    const std::pair<const char*, uint8_t> expected[] = {
-        {".text", RKSegmentText}, {".rodata", RKSegmentLinkedit}, {".data", RKSegmentData},
-        {"mapped file", RKSegmentNoImage},  // a mapping of no image segment
-    };
-    for (size_t i = 0; i < regions.size(); i++) {
-        EXPECT_EQ(regions[i]->name, expected[i].first) << i;
-        EXPECT_EQ(regions[i]->segment, expected[i].second) << i;
-        EXPECT_EQ(regions[i]->detailedName, "/bin/tool") << i;
-    }
-    EXPECT_FALSE(process->images()) << "images are dropped after the walk";
-    RKAnalysisSettings::resetCache();
 }

@@ -1,14 +1,13 @@
 // The kernel process on scripted kernel-memory records: zone arithmetic, how each kind of site
 // the Linux reader makes becomes a region or a counter, and what a refused or partial answer
 // reports.
-#include <gtest/gtest.h>
+#include "RKScriptedToolTest.h"
 
 #include <cstring>
 
 #include "model/RKAuxData.h"
 #include "model/RKMemoryRegion.h"
 #include "platform/RKLinuxKernelKinds.h"
-#include "platform/RKScriptedPlatform.h"
 #include "process/RKKernelProcess.h"
 
 namespace {
@@ -26,27 +25,15 @@ RKMemoryInfoRecord siteRecord(uint64_t flags, uint64_t site, uint64_t size, cons
     return record;
 }
 
-class RKKernelProcessTest : public ::testing::Test {
+class RKKernelProcessTest : public RKScriptedToolTest {
 protected:
-    RKKernelProcessTest() { platform->addProcess(0, "kernel", 0, PROC_FLAG_SYSTEM); }
-
-    std::shared_ptr<RKKernelProcess> gathered() {
-        auto process = std::dynamic_pointer_cast<RKKernelProcess>(RKProcess::processWithPid(0));
-        if (!process) return nullptr;
-        testing::internal::CaptureStderr();
-        process->gatherData();
-        printed = testing::internal::GetCapturedStderr();
-        return process;
-    }
+    std::shared_ptr<RKKernelProcess> gathered() { return made<RKKernelProcess>(0, false); }
     const RKMemoryRegion* named(const RKKernelProcess& process, const std::string& name) {
         for (const auto& region : *process.memoryRegions())
             if (region->name == name) return region.get();
         return nullptr;
     }
 
-    std::shared_ptr<RKScriptedPlatform> platform = std::make_shared<RKScriptedPlatform>();
-    RKScopedPlatform scope{platform};
-    std::string printed;
 };
 
 // The kinds of record the Linux kernel reader makes: slab caches as zones, and sites by tag,

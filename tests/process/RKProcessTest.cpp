@@ -1,18 +1,17 @@
 // Processes on scripted kernel answers: how a command line selects them (name and pid lookup,
-// descendants, exclusions, hidden extra targets), and how the region walk of a live process
-// turns entries into regions (sizes, names, identity), ends, and reports failures.
-#include <gtest/gtest.h>
+// descendants, exclusions, hidden extra targets), a pid reused under it, and how the region walk
+// of a live process turns entries into regions (sizes, names, images, identity, owned objects),
+// ends, and reports failures.
+#include "RKScriptedToolTest.h"
 
 #include <array>
 #include <cstring>
+#include <tuple>
 
 #include "driver/RKMemspreadArgs.h"
 #include "model/RKMemoryRegion.h"
 #include "platform/RKLinuxOwnedObjects.h"
 #include "platform/RKLinuxTags.h"
-#include "platform/RKScriptedPlatform.h"
-#include "process/RKAnalysisSettings.h"
-#include "process/RKUserProcess.h"
 #include "support/RKKeptArgv.h"
 
 namespace {
@@ -48,28 +47,8 @@ RKOwnedVmObjectRecord record(uint64_t id, uint64_t resident, uint64_t compressed
 using Sizes = std::array<uint64_t, 4>;
 Sizes sizes(const RKMemoryRegion& r) { return {r.dirtySize, r.reclaimableSize, r.swappedSize, r.cleanNonSpecSize}; }
 
-class RKProcessTest : public ::testing::Test {
+class RKProcessTest : public RKScriptedToolTest {
 protected:
-    RKProcessTest() {
-        platform->addProcess(0, "kernel", 0, PROC_FLAG_SYSTEM);
-        platform->addProcess(1, "init", 0);
-        platform->addProcess(7, "tool");
-        platform->selfPid = 600;
-    }
-    void TearDown() override { RKAnalysisSettings::resetCache(); }
-
-    RKScriptedProcess& tool() { return *platform->find(7); }
-    // Makes and gathers the tool, with or without the breakdown; `printed` is what it wrote.
-    std::shared_ptr<RKUserProcess> gathered(bool breakDown = false) {
-        platform->selfRegionValue = breakDown ? 1 : 0;
-        RKAnalysisSettings::resetCache();
-        testing::internal::CaptureStderr();
-        auto process = std::dynamic_pointer_cast<RKUserProcess>(RKProcess::processWithPid(7));
-        if (process) process->gatherData();
-        printed = testing::internal::GetCapturedStderr();
-        return process;
-    }
-
     // Resolves a command line (without the program name): the keys of its visible (or hidden)
     // targets; `printed` is what resolving wrote.
     Keys targets(std::vector<std::string> arguments, bool hidden = false, RKError* error = nullptr) {
@@ -83,10 +62,6 @@ protected:
             if (process->hiddenFromDisplay() == hidden) keys.push_back(key);
         return keys;
     }
-
-    std::shared_ptr<RKScriptedPlatform> platform = std::make_shared<RKScriptedPlatform>();
-    RKScopedPlatform scope{platform};
-    std::string printed;
 };
 
 }  // namespace
@@ -157,6 +132,27 @@ TEST_F(RKProcessTest, EntriesBecomeNamedRegionsOnce) {
     process->gatherData();
     EXPECT_EQ(platform->callCount("regionRecurse"), walkCalls) << "a second gather reads nothing";
     EXPECT_EQ(printed, "");
+}
+
+// Images, out of order as the Linux platform lists them, name the file regions they hold.
+TEST_F(RKProcessTest, ImagesNameTheRegionsTheyHold) {
+    RKRegionSubmapInfo file;
+    file.external_pager = 1;
+    for (uint64_t start : {0x10000, 0x12000, 0x14000, 0x20000})
+        tool().regions.push_back({start, 0x2000, file, RK_REGION_SUBMAP_INFO_COUNT, VM_PURGABLE_DENY, "/bin/tool", {}});
+    tool().images = {{"/bin/tool", 0x10000, 0x14000, 0x2000, ".data", RKSegmentData},
+                     {"/bin/tool", 0x10000, 0x10000, 0x2000, ".text", RKSegmentText},
+                     {"/bin/tool", 0x10000, 0x12000, 0x2000, ".rodata", RKSegmentLinkedit}};
+    auto process = gathered();
+    std::vector<std::tuple<std::string, uint8_t, std::string>> regions;
+    for (const auto& region : *process->memoryRegions())
+        regions.emplace_back(region->name, region->segment, region->detailedName);
+    EXPECT_EQ(regions, (std::vector<std::tuple<std::string, uint8_t, std::string>>{
+                           {".text", RKSegmentText, "/bin/tool"},
+                           {".rodata", RKSegmentLinkedit, "/bin/tool"},
+                           {".data", RKSegmentData, "/bin/tool"},
+                           {"mapped file", RKSegmentNoImage, "/bin/tool"}}));  // of no image segment
+    EXPECT_FALSE(process->images()) << "images are dropped after the walk";
 }
 
 TEST_F(RKProcessTest, SizesFollowTheBreakdown) {

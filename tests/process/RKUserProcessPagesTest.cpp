@@ -1,15 +1,12 @@
 // Page dispositions of a live process on scripted kernel answers: sizing a region from
 // dispositions (across query chunks, holes skipped, the page it shares with its neighbour),
 // subranges, which regions the walk reads page data for, and the shared region's pieces.
-#include <gtest/gtest.h>
+#include "RKScriptedToolTest.h"
 
 #include <tuple>
 
 #include "model/RKMemoryRegion.h"
 #include "model/RKRangeList.h"
-#include "platform/RKScriptedPlatform.h"
-#include "process/RKAnalysisSettings.h"
-#include "process/RKUserProcess.h"
 
 namespace {
 
@@ -26,33 +23,15 @@ std::shared_ptr<RKMemoryRegion> regionOf(uint64_t start, uint64_t end) {
     return region;
 }
 
-class RKUserProcessPagesTest : public ::testing::Test {
+class RKUserProcessPagesTest : public RKScriptedToolTest {
 protected:
-    RKUserProcessPagesTest() {
-        platform->addProcess(7, "tool");
-        platform->selfPid = 600;
-    }
-    void TearDown() override { RKAnalysisSettings::resetCache(); }
-
-    RKScriptedProcess& tool() { return *platform->find(7); }
     std::shared_ptr<RKUserProcess> process(bool gather = false, bool breakDown = true) {
-        platform->selfRegionValue = breakDown ? 1 : 0;
-        RKAnalysisSettings::resetCache();
-        testing::internal::CaptureStderr();
-        auto made = std::dynamic_pointer_cast<RKUserProcess>(RKProcess::processWithPid(7));
-        if (made && gather) made->gatherData();
-        // The steps called one by one read through the task that gathering would hold open.
-        if (made && !gather) made->_reopenTaskForGathering();
-        printed = testing::internal::GetCapturedStderr();
-        return made;
+        return made(7, breakDown, gather);
     }
     void script(uint64_t address, std::initializer_list<uint32_t> dispositions) {
         for (uint32_t d : dispositions) tool().dispositions[address] = d, address += P;
     }
 
-    std::shared_ptr<RKScriptedPlatform> platform = std::make_shared<RKScriptedPlatform>();
-    RKScopedPlatform scope{platform};
-    std::string printed;
 };
 
 // A terabyte reserved and barely touched (a sanitizer's shadow, a runtime's heap) costs its
