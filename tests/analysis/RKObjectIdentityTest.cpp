@@ -20,33 +20,10 @@ TEST(RKObjectIdentityTest, SharedObjectCountsOnceInSummaryAndAsChargedPerProcess
     EXPECT_EQ(recorder->journalText(), RKExpectedJournal("analysis-shared-object.txt"));
 }
 
-TEST(RKObjectIdentityTest, KeysSeparateWhatMustNotMeet) {
-    ScopedSettings settings(false);
-    auto cacheData = [](uint64_t objectId, uint64_t dirty) {
-        auto made = region(objectId, 0, 4096, dirty);
-        made->inSharedCache = true;
-        made->segment = RKSegmentData;
-        return made;
-    };
-    auto p1 = makeProcess(10, {cacheData(1, 0), region(0, 0, 4096, 0), region(0, 0, 4096, 0),
-                               region(~0ull, 0, 4096, 0)});
-    auto p2 = makeProcess(20, {cacheData(2, 0), cacheData(3, 4096)});
-    auto p3 = makeProcess(30, {cacheData(4, 4096)});
-    RKMemspread memspread({p1, p2, p3});
-    memspread.analyzeData();
-    auto objectOf = [](const auto& process, size_t i) { return (*process->memoryRegions())[i]->memoryObject(); };
-    // Clean shared-cache data is shared by address whatever the object id; dirtied, it is the
-    // process's own.
-    EXPECT_EQ(objectOf(p1, 0), objectOf(p2, 0));
-    EXPECT_NE(objectOf(p2, 1), objectOf(p2, 0));
-    EXPECT_NE(objectOf(p2, 1), objectOf(p3, 0));
-    // No object id, or an invalid one: one object per region.
-    EXPECT_EQ(memspread.identityMaps()->uniqueMemoryObjects.size(), 3u);
-}
-
 // Private ids are found within their process, processes side by side: two regions of one id are
 // one object, listed once in the private group, and never another process's; processes whose
-// pids carry the same bits (two snapshots of one process) still meet.
+// pids carry the same bits (two snapshots of one process) still meet. A region without an object
+// id, or with an invalid one, is an object of its own.
 TEST(RKObjectIdentityTest, PrivateIdsMeetOnlyWhereTheirPidBitsDo) {
     ScopedSettings settings(false);
     auto privatePage = [](pid_t pid, uint64_t offset) {
@@ -54,7 +31,8 @@ TEST(RKObjectIdentityTest, PrivateIdsMeetOnlyWhereTheirPidBitsDo) {
     };
     constexpr pid_t kSameBits = 30 + (1 << 22);
     auto p10 = makeProcess(10, {privatePage(10, 0), region(7, 0, 4096, 0), privatePage(10, 4096)});
-    auto p20 = makeProcess(20, {privatePage(20, 0), region(7, 0, 4096, 0)});
+    auto p20 = makeProcess(20, {privatePage(20, 0), region(7, 0, 4096, 0), region(0, 0, 4096, 0), region(0, 0, 4096, 0),
+                                region(~0ull, 0, 4096, 0)});
     auto p30 = makeProcess(30, {privatePage(30, 0)});
     auto twin = makeProcess(kSameBits, {privatePage(kSameBits, 0)});
     RKMemspread memspread({p10, p20, p30, twin});
@@ -64,6 +42,7 @@ TEST(RKObjectIdentityTest, PrivateIdsMeetOnlyWhereTheirPidBitsDo) {
     EXPECT_NE(objectOf(p10, 0), objectOf(p20, 0));
     EXPECT_EQ(objectOf(p30, 0), objectOf(twin, 0));
     EXPECT_EQ(memspread.pidToMemspread().at(10), 8192u);
+    EXPECT_EQ(memspread.identityMaps()->uniqueMemoryObjects.size(), 3u);
 
     const RKProcessToGroupsMap groups = memspread._generateProcessToProcessGroups();
     const RKProcessGroup& own = *groups.at(10).front();
