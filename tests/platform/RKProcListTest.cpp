@@ -1,4 +1,5 @@
-// The /proc process list on a small fake proc root.
+// The /proc process list on a small fake proc root. (That a task reads the process it was opened
+// on, every end-to-end run shows: otherwise each process would read as reused, and gone.)
 #include <gtest/gtest.h>
 #include <unistd.h>
 
@@ -6,6 +7,7 @@
 #include <fstream>
 
 #include "platform/RKLinuxPlatform.h"
+#include "platform/RKProcStatParser.h"
 #include "process/RKProcess.h"
 
 namespace fs = std::filesystem;
@@ -60,4 +62,9 @@ TEST(RKProcList, ListsProcessesAfterTheKernelWithoutKernelThreadsAndDescribesEac
 
     fs::remove_all(root);
     EXPECT_FALSE(platform.listAllPids()) << "an unreadable proc root is a failure";
+
+    // The start time that tells a reused pid from the process listed under it: field 22.
+    std::string line = "41 (a) b) R 1 41 41 0 -1 4194560 97 0 0 0 1 2 0 0 20 0 1 0 123456 4096 100";
+    EXPECT_EQ(RKParseProcStat(line)->startTime, 123456u);
+    EXPECT_EQ(RKParseProcStat("41 (a) R 1 41 41 0 -1 4194560")->startTime, 0u) << "absent: 0";
 }
