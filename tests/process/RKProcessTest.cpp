@@ -226,21 +226,18 @@ TEST_F(RKProcessTest, ListedObjectsAreChargedOnceFromTheirRecords) {
     const RKRegionList& regions = *process->memoryRegions();
     ASSERT_EQ(regions.size(), 4u);
 
-    const RKMemoryRegion& first = *regions[0];
-    EXPECT_TRUE(first.ownedExclusivelyByParentProcess && first.name == "memfd (graphics)");
-    EXPECT_EQ(first.dirtySize, 9 * P) << "resident less reusable";
-    EXPECT_EQ(first.swappedSize, 2 * P);
-    EXPECT_TRUE(first.cleanNonSpecSize == 0 && first.reclaimableSize == P);
-    EXPECT_EQ(regions[1]->dirtySize + regions[1]->swappedSize, 0u) << "the object is already charged whole";
-    EXPECT_EQ(regions[2]->dirtySize, 2 * P) << "not listed: its own counters";
-    EXPECT_FALSE(regions[2]->ownedExclusivelyByParentProcess);
-
+    // Owned, name, dirty, swapped, clean and reclaimable bytes.
+    auto row = [](const RKMemoryRegion& r) {
+        return std::tuple(r.ownedExclusivelyByParentProcess, r.fullName(), r.dirtySize, r.swappedSize,
+                          r.cleanNonSpecSize, r.reclaimableSize);
+    };
+    EXPECT_EQ(row(*regions[0]), std::tuple(true, "memfd (graphics)", 9 * P, 2 * P, 0u, P)) << "resident less reusable";
+    EXPECT_EQ(row(*regions[1]), std::tuple(true, "memfd", 0u, 0u, 0u, 0u)) << "the object is already charged whole";
+    EXPECT_EQ(row(*regions[2]), std::tuple(false, "memfd", 2 * P, 0u, 0u, 0u)) << "not listed: its own counters";
     const RKMemoryRegion& unmapped = *regions[3];
-    EXPECT_EQ(unmapped.name + " " + unmapped.detailedName, "Owned physical memspread (unmapped) buffer");
+    EXPECT_EQ(row(unmapped), std::tuple(true, "Owned physical memspread (unmapped) buffer", 5 * P, 3 * P, 0u, P));
     EXPECT_TRUE(unmapped.start == RKRegionNoAddress && unmapped.size == 64 * P && unmapped.share_mode == SM_SHARED);
-    EXPECT_TRUE(unmapped.ownedExclusivelyByParentProcess && unmapped.wired && unmapped.isFake());
-    EXPECT_EQ(unmapped.dirtySize, 5 * P);
-    EXPECT_EQ(unmapped.swappedSize, 3 * P);
+    EXPECT_TRUE(unmapped.wired && unmapped.isFake());
 }
 
 // The breakdown off asks for no list; a list that cannot be read is a warning.

@@ -100,12 +100,8 @@ TEST_F(RKVmsnapTest, GraphSurvivesTheFileCompressedAndEveryDamageIsAnError) {
 }
 
 TEST_F(RKVmsnapTest, DescriptionChoosesThePlatformAndTranslation) {
-    const struct {
-        std::string description;
-        std::string images;
-        uint64_t base;
-        bool translated;
-    } cases[] = {
+    // Description, image descriptions, the shared region's base, translated.
+    const std::tuple<std::string, std::string, uint64_t, bool> cases[] = {
         {"Linux x86_64 6.18", "", 0, false},
         {"macOS X86-64 (X86 compatible) (translated)", "", 0x7FFF00000000, true},
         {"X86", "", 0x90000000, false},
@@ -114,12 +110,11 @@ TEST_F(RKVmsnapTest, DescriptionChoosesThePlatformAndTranslation) {
         {"ARM", "libfoo (arm64_32)", 0x1A000000, false},
         {"ARM", "libfoo (armv7k)", 0x40000000, false},
     };
-    for (const auto& c : cases) {
-        SCOPED_TRACE(c.description);
-        Opened opened = open(snapshot(c.description, "[]", R"(,"binaryImagesDescription":")" + c.images + "\""));
+    for (const auto& [description, images, base, translated] : cases) {
+        SCOPED_TRACE(description);
+        Opened opened = open(snapshot(description, "[]", R"(,"binaryImagesDescription":")" + images + "\""));
         ASSERT_TRUE(opened.process);
-        EXPECT_EQ(opened.process->sharedRegionBase(), c.base);
-        EXPECT_EQ(opened.process->isTranslated(), c.translated);
+        EXPECT_EQ(std::pair(opened.process->sharedRegionBase(), opened.process->isTranslated()), std::pair(base, translated));
         EXPECT_EQ(opened.process->displayString(), "tool [42] (vmsnap)");
     }
     Opened unknown = open(snapshot("PowerPC"));
