@@ -7,6 +7,23 @@
 #include "model/RKProcessGroup.h"
 #include "platform/RKLinuxVmaClassifier.h"
 
+namespace {
+
+// A mapping of all 16K of object 9, `dirty` bytes of it dirty, the rest clean.
+std::shared_ptr<RKMemoryRegion> owned(bool claimed, uint64_t dirty = 8192) {
+    auto made = region(9, 0, 16384, dirty);
+    made->ownedExclusivelyByParentProcess = claimed;
+    return made;
+}
+
+// A process of the live system (the test processes stand for snapshots otherwise).
+class RKLiveTestProcess : public RKTestProcess {
+public:
+    bool _isAlive() const override { return true; }
+};
+
+}  // namespace
+
 // A maps [0, 8K) of object 7 dirty; B maps the same pages and 4K more further on. The pages both
 // map count once in the summary; each process is charged its own pages with the breakdown on and
 // the whole object with it off; without sharing analysis no process has a view of its own.
@@ -56,33 +73,16 @@ TEST(RKObjectIdentityTest, PrivateIdsMeetOnlyWhereTheirPidBitsDo) {
 // B maps memory that A owns: with the breakdown on, B sees its dirty and swapped bytes as clean.
 TEST(RKObjectIdentityTest, OwnedMemoryLooksCleanToOtherMappers) {
     ScopedSettings settings(true);
-    auto owned = [](bool claimed) {
-        auto made = region(9, 0, 16384, 8192);
+    auto swapping = [](bool claimed) {
+        auto made = owned(claimed);
         made->swappedSize = 4096;
         made->cleanNonSpecSize = 4096;
-        made->ownedExclusivelyByParentProcess = claimed;
         return made;
     };
     auto recorder = std::make_shared<RKRecordingFormatter>("F", false);
-    report({makeProcess(10, {owned(true)}), makeProcess(20, {owned(false)})}, {recorder});
+    report({makeProcess(10, {swapping(true)}), makeProcess(20, {swapping(false)})}, {recorder});
     EXPECT_EQ(recorder->journalText(), RKExpectedJournal("analysis-owned-memory.txt"));
 }
-
-namespace {
-
-std::shared_ptr<RKMemoryRegion> owned(bool claimed, uint64_t dirty = 8192) {
-    auto made = region(9, 0, 16384, dirty);
-    made->ownedExclusivelyByParentProcess = claimed;
-    return made;
-}
-
-// A process of the live system (the test processes stand for snapshots otherwise).
-class RKLiveTestProcess : public RKTestProcess {
-public:
-    bool _isAlive() const override { return true; }
-};
-
-}  // namespace
 
 // Who is charged for an owned object: its one owner alone (the golden journal above), or, when
 // several processes own it (a memfd whose descriptor several hold), each of them as for any

@@ -32,7 +32,6 @@ protected:
             if (region->name == name) return region.get();
         return nullptr;
     }
-
 };
 
 // The kinds of record the Linux kernel reader makes: slab caches as zones, and sites by tag,

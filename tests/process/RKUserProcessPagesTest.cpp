@@ -1,6 +1,6 @@
 // Page dispositions of a live process on scripted kernel answers: sizing a region from
-// dispositions (across query chunks, holes skipped, the page it shares with its neighbour),
-// subranges, which regions the walk reads page data for, and the shared region's pieces.
+// dispositions (holes never asked about, the page it shares with its neighbour), subranges, which
+// regions the walk reads page data for, and the shared region's pieces.
 #include "RKScriptedToolTest.h"
 
 #include <tuple>
@@ -31,7 +31,6 @@ protected:
     void script(uint64_t address, std::initializer_list<uint32_t> dispositions) {
         for (uint32_t d : dispositions) tool().dispositions[address] = d, address += P;
     }
-
 };
 
 // A terabyte reserved and barely touched (a sanitizer's shadow, a runtime's heap) costs its
