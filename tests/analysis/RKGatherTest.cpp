@@ -1,6 +1,5 @@
 // Gathering orchestration: every process gathered once on niced workers between the stamps,
-// a cancel before gathering and its early-exit error, the cached breakdown setting, and SIGINT
-// delivered as an event.
+// a cancel before or during gathering and its early-exit error, and SIGINT delivered as an event.
 #include <gtest/gtest.h>
 
 #include <signal.h>
@@ -106,17 +105,6 @@ TEST(RKGather, EveryProcessIsGatheredOnceOnNicedWorkersBetweenTheStamps) {
     sampling.setQualityOfService(QOS_CLASS_USER_INITIATED);
     sampling.gatherData();
     EXPECT_EQ(g.processes[0]->niceness, ownNiceness());
-}
-
-TEST(RKGather, TheBreakdownSettingIsAskedOnceUntilItIsSet) {
-    Gathering g({});
-    RKAnalysisSettings::resetCache();
-    EXPECT_FALSE(RKMemspread::breakDownPhysMemspread());
-    EXPECT_FALSE(RKMemspread::breakDownPhysMemspread());
-    RKMemspread::setBreakDownPhysMemspread(true);
-    EXPECT_TRUE(RKMemspread::breakDownPhysMemspread());
-    EXPECT_EQ(g.platform->callCount("readSelfRegionMemspread"), 2u) << "asked once, then once more after the change";
-    RKAnalysisSettings::resetCache();
 }
 
 // SIGINT is ignored and comes to the handler as an event, once per signal, until the source

@@ -1,10 +1,14 @@
 // The system map on scripted answers: which figure goes to which term, memory shared between
 // processes counted once, the processes' page tables taken out of the kernel's, and processes
-// that could not be read left to "unattributed".
+// that could not be read left to "unattributed". And a process that all-process selection could
+// not open, through a whole report: a warning of the run with its pid and reason, never a
+// measured process; one that is simply gone is not named at all. (How the text and JSON reports
+// escape a warning, their golden files show.)
 #include <gtest/gtest.h>
 
 #include <algorithm>
 #include <cstring>
+#include <set>
 
 #include "analysis/RKSystemMemory.h"
 #include "platform/RKLinuxKernelKinds.h"
@@ -104,28 +108,48 @@ TEST_F(RKSystemMemoryTest, TermsAddUpToMemTotalWithEveryByteInOneTerm) {
     EXPECT_FALSE(RKAccountForSystemMemory(users, true).map);
 }
 
-// Keeps the report-wide aux data it is given.
-class RKGlobalAuxRecorder : public RKRecordingFormatter {
-public:
-    void printGlobalAuxData(const std::shared_ptr<RKAuxDataMap>& auxData) override {
-        RKRecordingFormatter::printGlobalAuxData(auxData);
-        global = auxData;
-    }
-    std::shared_ptr<RKAuxDataMap> global;
-};
-
-TEST_F(RKSystemMemoryTest, OnlyARunOverEveryProcessReportsTheMapAndTheUnreadableOnes) {
+// Only a run over every process accounts for the system, and says how many processes it could
+// not read.
+TEST_F(RKSystemMemoryTest, OnlyARunOverEveryProcessReportsTheUnreadableOnes) {
     for (bool whole : {false, true}) {
-        auto recorder = std::make_shared<RKGlobalAuxRecorder>();
+        auto recorder = std::make_shared<RKRecordingFormatter>();
         RKMemspread memspread(gathered());
         memspread.setMeasuresWholeSystem(whole);
         memspread.analyzeData();
         memspread.addOutputFormatter(recorder);
         memspread.printOutputVerbose(false, true);
         const std::string calls = recorder->journalText();
-        EXPECT_EQ(recorder->global && recorder->global->objectForKey("system"), whole) << calls;
-        EXPECT_EQ(calls.find(" [1 processes could not be read") != std::string::npos, whole) << calls;
+        EXPECT_EQ(calls.find(" [1 processes could not be read: their memory is in the system's \"unattributed\"]") !=
+                      std::string::npos,
+                  whole)
+            << calls;
     }
+}
+
+TEST_F(RKSystemMemoryTest, ProcessThatCouldNotBeOpenedIsAWarningOfTheRun) {
+    platform->addProcess(8, "guard\x1b]0;").taskResult = KERN_PROTECTION_FAILURE;
+    platform->addProcess(9, "starved").taskResult = KERN_RESOURCE_SHORTAGE;
+    platform->addProcess(10, "exited").taskResult = KERN_INVALID_ARGUMENT;
+    testing::internal::CaptureStderr();
+    auto targets = RKProcess::allProcessesExcludingPids({});
+    EXPECT_EQ(testing::internal::GetCapturedStderr(),
+              "task_for_pid: permission denied\ntask_for_pid: too many open files\ntask_for_pid: process is gone\n");
+    ASSERT_TRUE(targets);
+    EXPECT_EQ(targets->count(10), 0u) << "a process that is gone is no longer part of the system";
+    RKProcessList processes;
+    for (const auto& entry : *targets) processes.push_back(entry.second);
+    auto recorder = std::make_shared<RKRecordingFormatter>("F", false);
+    RKMemspread memspread(processes);
+    memspread.gatherData();
+    memspread.analyzeData();
+    memspread.addOutputFormatter(recorder);
+    memspread.printOutputVerbose(false, false);
+    std::set<pid_t> headers;
+    for (const auto& call : recorder->callsNamed("printProcessHeader")) headers.insert(call.pid);
+    EXPECT_EQ(headers, (std::set<pid_t>{0, 7})) << recorder->journalText();
+    EXPECT_EQ(recorder->callsNamed("printProcessesWithWarnings")[0].arguments, " warnings=8,9 errors=-");
+    EXPECT_EQ(processes.at(2)->warnings(), std::vector<std::string>{"guard\x1b]0; [8]: not measured - permission denied"});
+    EXPECT_EQ(processes.at(3)->warnings(), std::vector<std::string>{"starved [9]: not measured - too many open files"});
 }
 
 }  // namespace

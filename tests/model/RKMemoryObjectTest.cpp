@@ -1,14 +1,13 @@
-// Memory objects, the regions that map them and the groups of processes that share them.
+// Memory objects and the regions that map them. (Groups of the processes that share them, found
+// by member set, are in the analysis tests' golden journals.)
 #include "model/RKMemoryObject.h"
 
 #include <gtest/gtest.h>
 
 #include <array>
-#include <unordered_set>
 #include <vector>
 
 #include "model/RKMemoryRegion.h"
-#include "model/RKProcessGroup.h"
 #include "platform/RKScriptedPlatform.h"
 #include "process/RKAnalysisSettings.h"
 
@@ -159,25 +158,4 @@ TEST(RKMemoryRegion, EligibilityForProcessViewsAndSubranges) {
     EXPECT_EQ(eligible([](auto& r) { r.reclaimableSize = r.size; }), Both(true, false));
     EXPECT_EQ(eligible([](auto& r) { r.size = kPage; }), Both(true, false));
     EXPECT_EQ(eligible([](auto& r) { r.ownedExclusivelyByParentProcess = true; }), Both(true, false));
-}
-
-// The group built for each memory object finds the one interned group of its member set;
-// interned groups are equal only to themselves.
-TEST(RKProcessGroup, MinimalGroupsFindTheirInternedTwinByMemberSet) {
-    auto groupOf = [](std::initializer_list<pid_t> pids) {
-        auto group = std::make_shared<RKProcessGroupMinimal>();
-        for (pid_t pid : pids) group->addProcess(makeProcess(pid));
-        return group;
-    };
-    std::unordered_set<std::shared_ptr<RKProcessGroup>, RKProcessGroupHash, RKProcessGroupEqual> interned;
-    auto group = groupOf({1, 2})->immutableCopy();
-    interned.insert(group);
-    auto twin = groupOf({1, 2});
-    twin->addProcess(makeProcess(2));  // an equal process is already a member
-    auto found = interned.find(*twin);
-    ASSERT_NE(found, interned.end());
-    EXPECT_EQ(*found, group);
-    EXPECT_TRUE(group->isEqual(*groupOf({2, 1})));
-    EXPECT_EQ(interned.find(*groupOf({1, 2, 3})), interned.end());
-    EXPECT_TRUE(interned.insert(groupOf({1, 2})->immutableCopy()).second);
 }

@@ -2,7 +2,6 @@
 
 #include <gtest/gtest.h>
 
-#include <algorithm>
 #include <array>
 #include <random>
 #include <vector>
@@ -36,19 +35,6 @@ TEST(RKRangeList, MergesOverlappingAndTouchingRangesWithoutCountingTwice) {
     // A range between two nodes bridges them.
     EXPECT_EQ(nodesAfter({{3 * kPage, kPage, kPage}, {0, kPage, kPage}, {kPage + 10, 2 * kPage - 20, 2 * kPage - 20}}),
               (std::vector{node(0, 4 * kPage, 4 * kPage - 20)}));
-}
-
-TEST(RKRangeList, DisjointRangesEndTheSameWhateverTheInsertionOrder) {
-    std::vector<RKRangeListNode> ranges;  // sub-page ranges, a page apart
-    for (uint64_t i = 0; i < 300; ++i) ranges.push_back(node(i * 2 * kPage + i % 7, kPage - 7, i + 1));
-    std::vector<RKRangeListNode> shuffled = ranges;
-    std::mt19937_64 random(7);
-    for (int round = 0; round < 3; ++round) {
-        RKRangeList list;
-        for (const auto& range : shuffled) list.addRange(range.location, range.length, kPage, dirty(range.dirty));
-        EXPECT_EQ(list.nodes(), ranges) << round;
-        std::shuffle(shuffled.begin(), shuffled.end(), random);
-    }
 }
 
 // Queued insertions are placed in batches when the list is read; that must give exactly the

@@ -1,6 +1,8 @@
 // Whole reports of hand-made measurements, made call by call as the analysis makes them, written
 // by the text formatter (in several formats) and by the JSON formatter and compared with golden
-// files; and the pieces that the reports cannot show.
+// files; what the metrics log records of one; and the sort orders the reports cannot show. (That
+// the metrics log holds every finished sample as JSON lines before it is closed, and that a JSON
+// document larger than the writer's buffer parses, RKSamplingEndToEnd and RKAllProcesses show.)
 #include <gtest/gtest.h>
 #include <time.h>
 #include <unistd.h>
@@ -19,11 +21,9 @@
 #include "model/RKMemoryRegion.h"
 #include "model/RKProcessGroup.h"
 #include "model/RKTime.h"
-#include "output/RKJsonDateFormatter.h"
-#include "output/RKJsonWriter.h"
 #include "output/RKOutputFormatterJSON.h"
+#include "output/RKOutputFormatterMetrilog.h"
 #include "output/RKOutputFormatterText.h"
-#include "output/RKTextDate.h"
 #include "platform/RKScriptedPlatform.h"
 #include "process/RKAnalysisSettings.h"
 #include "support/RKRunCommand.h"
@@ -324,18 +324,63 @@ TEST(RKOutputReport, EverySortColumnOrdersTheRows) {
     EXPECT_DEATH(RKOutputFormatterText(RKSummaryFormatFormatted, 0, "Size"), "Unhandled text sort column");
 }
 
-TEST(RKJsonWriter, LosesNothingAcrossBufferFlushes) {
-    char* data = nullptr;
-    size_t size = 0;
-    std::string expected = "[";
-    RKJsonWriter json(RKJsonWriter::File(open_memstream(&data, &size)));
-    json.beginArray();
-    for (uint64_t i = 0; i < 100000; i++) {
-        json.unsignedValue(i * 1000003);
-        expected += (i ? "," : "") + std::to_string(i * 1000003);
-    }
-    json.endArray();
-    EXPECT_TRUE(json.close());
-    EXPECT_EQ(std::string(data, size), expected + "]");
-    std::free(data);
+// A process whose own and shared memory both hold "heap /h" records it once, summed; shared
+// memory before any own memory is not recorded; a process with errors records its aux data under
+// its own name; a summary without aux data records one "aux_data" of 0; 2.5 ms are 2 ms.
+TEST(RKMetricsLog, RecordsProcessGroupsAndTheSummaryGroupOfAReport) {
+    auto platform = std::make_shared<RKScriptedPlatform>();  // wall clock at 0
+    platform->selfRegionValue = 1;
+    RKScopedPlatform scope(platform);
+    RKAnalysisSettings::resetCache();
+    const std::string path = testing::TempDir() + "rkmetrilog-" + std::to_string(getpid()) + ".mlj";
+    auto log = RKOutputFormatterMetrilog::initWithPath(path);
+    ASSERT_TRUE(log) << path;
+    auto continuousAt = [](uint64_t nanoseconds) { return RKTime::fromReadings({0, nanoseconds, 978307200, 0}); };
+    auto alpha = process(10, "alpha"), beta = process(20, "beta"), failed = process(30, "failed");
+    failed->errors_ = {"failed [30]: task_for_pid failed"};
+    auto both = group({alpha, beta});
+    const RKCategoryMap sharedHeap = categories({{"heap", "/h", {.dirty = 2000}}});
+
+    log->startAtTime(continuousAt(1000000000));
+    log->printProcessHeader(*alpha);
+    log->printProcessTotal(4000, *alpha);
+    log->printProcessCategories(categories({{"heap", "/h", {.dirty = 1000, .swapped = 24}}, {"stack", "", {.dirty = 976}}}), {});
+    log->printSharedCategories(sharedHeap, *both, *alpha, false, {});
+    log->printProcessAuxData(aux({{"kernel", aux({{"page_table", std::make_shared<RKAuxData>(-8, false)}})},
+                                  {"phys", std::make_shared<RKAuxData>(7, true)}}));
+    log->printProcessHeader(*beta);
+    log->printProcessTotal(2000, *beta);
+    log->printSharedCategories(sharedHeap, *both, *beta, false, {});
+    log->printProcessAuxData(nullptr);
+    log->printProcessHeader(*failed);
+    log->printProcessCategories({}, {});
+    log->printProcessAuxData(nullptr);
+    log->printProcessesWithWarnings({}, {failed}, {});
+    log->printSummaryCategories(categories({{"heap", "", {.dirty = 3000, .swapped = 24}}, {"stack", "", {.dirty = 976}}}),
+                                {.dirty = 3976, .swapped = 24}, true);
+    log->printGlobalAuxData(nullptr);
+    log->endAtTime(continuousAt(1002500000));
+    log->close();
+
+    auto line = [](int group, const std::string& metric, const std::string& value, const std::string& process,
+                   const std::string& rest = R"("labels":{},"tags":[])", const std::string& unit = "B") {
+        std::string variables = process.empty() ? "{}" : R"({"process":")" + process + R"("})";
+        return R"({"group":)" + std::to_string(group) + R"(,"time":0,"metric":")" + metric + R"(","unit":")" + unit +
+               R"(","value":)" + value + R"(,"variables":)" + variables + "," + rest + "}\n";
+    };
+    const std::string context = R"("labels":{},"tags":["context"])", summary = R"("labels":{},"tags":["summary"])";
+    EXPECT_EQ(RKFileText(path),
+              R"({"log":"memspread.phys_memspread","format":1,"description":"Memory measurements gathered by the )"
+              R"(memspread(1) tool","primary_metric":"total_memory,process=ALL_PROCESSES"})" "\n" +
+                  line(1, "total_memory", "4000", "alpha", R"("labels":{"pid":"10"},"tags":["summary"])") +
+                  line(1, "heap /h", "3024", "alpha") + line(1, "stack", "976", "alpha") +
+                  line(1, "aux_data.kernel.page_table", "-8", "alpha", context) +
+                  line(1, "aux_data.phys", "7", "alpha", context) +
+                  line(2, "total_memory", "2000", "beta", R"("labels":{"pid":"20"},"tags":["summary"])") +
+                  line(2, "aux_data", "0", "beta", context) + line(3, "aux_data", "0", "failed", context) +
+                  line(4, "total_memory", "4000", "ALL_PROCESSES", summary) +
+                  line(4, "heap", "3024", "ALL_PROCESSES") + line(4, "stack", "976", "ALL_PROCESSES") +
+                  line(4, "aux_data", "0", "ALL_PROCESSES", context) +
+                  line(4, "gather_duration", "2", "", context, "ms"));
+    std::remove(path.c_str());
 }

@@ -1,14 +1,10 @@
-// The descriptor budget that lets any descriptor limit measure every process, and the records a
-// task reads through its own directory descriptor.
+// The descriptor budget that lets any descriptor limit measure every process.
 #include <gtest/gtest.h>
-#include <unistd.h>
 
 #include <atomic>
 #include <thread>
 
 #include "platform/RKDescriptorBudget.h"
-#include "platform/RKLinuxPlatform.h"
-#include "platform/RKProcStatParser.h"
 
 using namespace std::chrono_literals;
 
@@ -46,25 +42,4 @@ TEST(RKDescriptorBudget, SizedFromTheLimitWaitsForASlotAndShrinksOnFailure) {
     RKDescriptorTicket nested = impatient.acquire(&timedOut);  // a holder asking again is not stuck forever
     EXPECT_TRUE(timedOut);
     EXPECT_EQ(impatient.inUse(), 2u);
-}
-
-TEST(RKLinuxTask, ReadsTheProcessItWasOpenedOn) {
-    std::string line = "41 (a) b) R 1 41 41 0 -1 4194560 97 0 0 0 1 2 0 0 20 0 1 0 123456 4096 100";
-    EXPECT_EQ(RKParseProcStat(line)->startTime, 123456u);
-    EXPECT_EQ(RKParseProcStat("41 (a) R 1 41 41 0 -1 4194560")->startTime, 0u) << "absent: 0";
-
-    RKLinuxPlatform platform;
-    std::unique_ptr<RKTask> task;
-    ASSERT_EQ(platform.taskForPid(getpid(), task), KERN_SUCCESS);
-    auto listed = platform.bsdInfo(getpid());
-    auto opened = platform.taskBsdInfo(*task);
-    ASSERT_TRUE(listed && opened);
-    EXPECT_GT(opened->pbi_start_tvsec + opened->pbi_start_tvusec, 0u);
-    EXPECT_EQ(std::pair(opened->pbi_start_tvsec, opened->pbi_start_tvusec),
-              std::pair(listed->pbi_start_tvsec, listed->pbi_start_tvusec));
-    EXPECT_EQ(platform.taskExecutablePath(*task), platform.executablePath(getpid()));
-    uint32_t status = 0;
-    EXPECT_EQ(platform.taskShortBsdInfoStatus(*task, status), 0);
-    std::unique_ptr<RKTask> none;
-    EXPECT_EQ(platform.taskForPid(0x3FFFFFFF, none), KERN_INVALID_ARGUMENT) << "no such process: gone";
 }

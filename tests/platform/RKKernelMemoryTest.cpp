@@ -5,6 +5,7 @@
 
 #include <set>
 #include <sstream>
+#include <tuple>
 
 #include "platform/RKLinuxKernelKinds.h"
 #include "platform/RKLinuxKernelMemory.h"
@@ -92,10 +93,9 @@ TEST_F(RKKernelMemoryTest, ParsersReadEveryLineOfTheCapturesAndRefuseWhatIsNotTh
                        "0x5-0x6    8192 acpi_os_map_iomem+0x1bc/0x1e0 phys=0x000a0000 ioremap\n",
                        areas);
     ASSERT_EQ(areas.size(), 3u);
-    EXPECT_EQ(areas[1].caller, "kernel_clone");
-    EXPECT_EQ(areas[1].pages, 4u);
-    EXPECT_EQ(areas[1].size, 20480u) << "the guard page is in the size, not in pages=";
-    EXPECT_EQ(areas[2].flags, RKVmallocIoremap);
+    EXPECT_EQ(std::tuple(areas[1].caller, areas[1].pages, areas[1].size, areas[2].flags),
+              std::tuple("kernel_clone", 4u, 20480u, RKVmallocIoremap))
+        << "the guard page is in the size, not in pages=";
     EXPECT_EQ(RKParseVmallocinfo("not an area\n0x1-0x2 big\n", areas), 2u);
 
     std::vector<RKKernelModule> list;

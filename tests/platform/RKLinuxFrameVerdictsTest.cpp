@@ -59,12 +59,3 @@ TEST(RKFrameVerdicts, ReadOnceAGatherAcrossWordsAndChunks) {
     EXPECT_EQ(ask(*gather.verdicts(), counts, flags, frames), std::vector<uint8_t>(frames.size(), 0));
     gather.end();
 }
-
-TEST(RKFrameVerdicts, AFramePastTheEndOfMemoryIsNoSharingAndStaysUnknown) {
-    FrameFile counts, flags;
-    counts.set(10, 3), flags.set(10, 0);
-    RKFrameVerdicts verdicts;
-    EXPECT_EQ(ask(verdicts, counts, flags, {10, 1u << 20}), (std::vector<uint8_t>{1, 0}));
-    counts.set(1u << 20, 2), flags.set(1u << 20, 0);
-    EXPECT_EQ(ask(verdicts, counts, flags, {1u << 20}), std::vector<uint8_t>{1}) << "read again once it can be";
-}

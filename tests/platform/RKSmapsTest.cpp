@@ -133,19 +133,16 @@ TEST_F(RKSmapsTest, ParsingSkipsWhatItCannotReadWithoutLosingItsNeighbours) {
     EXPECT_EQ(cut.back().vmFlags, 0u);
 }
 
-TEST_F(RKSmapsTest, PrivatelyMappedShmemIsMemoryAndReachesItsObjectUntilCopied) {
-    // A memfd mapped privately and writable: 8 pages resident, none copied yet.
+// A memfd mapped privately and writable reaches the object's pages until written through; its
+// copies then make it the process's own. (That its pages are memory, not clean page cache, the
+// table above and RKOwnedMemoryFixture show.)
+TEST_F(RKSmapsTest, PrivatelyMappedShmemReachesItsObjectUntilCopied) {
     RKSmapsVma vma = at(0x7f0000245000);
     vma.perms = RKSmapsRead | RKSmapsWrite;
     vma.rss = 32;
-    RKRegionSubmapInfo object = RKRegionInfoForVma(vma, RKVmaKind::Shmem, context_);
-    EXPECT_EQ(object.object_id_full, info(0x7f0000245000).object_id_full) << "the object's pages, shared";
-    EXPECT_EQ(object.pages_dirtied, 8u) << "shmem pages are memory, not clean page cache";
-
-    // Once written through, its copies make it the process's own: all 8 pages stay dirty.
+    EXPECT_EQ(RKRegionInfoForVma(vma, RKVmaKind::Shmem, context_).object_id_full, info(0x7f0000245000).object_id_full);
     vma.anonymous = 8;
     RKRegionSubmapInfo copied = RKRegionInfoForVma(vma, RKVmaKind::Shmem, context_);
-    EXPECT_NE(copied.object_id_full, object.object_id_full);
-    EXPECT_EQ(copied.pages_dirtied, 8u);
-    EXPECT_EQ(copied.share_mode, SM_COW);
+    EXPECT_NE(copied.object_id_full, info(0x7f0000245000).object_id_full);
+    EXPECT_EQ(std::pair(copied.pages_dirtied, copied.share_mode), std::pair(8u, uint8_t{SM_COW})) << "all 8 pages stay dirty";
 }

@@ -1,39 +1,21 @@
-// Images: the segment a name implies, the forward-only enumerator the walk names regions with,
-// the intern tables shared by gathering threads, and the images of a process on scripted
-// answers naming its regions.
+// Images: the forward-only enumerator the walk names regions with, and the intern tables shared
+// by gathering threads. (How images name a process's regions is in RKProcessTest.)
 #include <gtest/gtest.h>
 
 #include <thread>
 
-#include "model/RKMemoryRegion.h"
-#include "platform/RKScriptedPlatform.h"
-#include "process/RKAnalysisSettings.h"
 #include "process/RKImage.h"
-#include "process/RKUserProcess.h"
 
 namespace {
 
-std::shared_ptr<RKImage> image(uint64_t start, uint64_t size, const char* name = "__DATA") {
+std::shared_ptr<RKImage> image(uint64_t start, uint64_t size) {
     auto result = std::make_shared<RKImage>();
     result->start = start;
     result->size = size;
-    result->setName(RKUnsharedString(name));
     return result;
 }
 
 }  // namespace
-
-TEST(RKImage, NamePrefixDecidesTheSegment) {
-    const std::pair<const char*, uint8_t> cases[] = {
-        {"__TEXT", RKSegmentText},          {"__OBJC_RO", RKSegmentText}, {"__LINKEDIT", RKSegmentLinkedit},
-        {"__DATA_CONST", RKSegmentData},    {"__AUTH", RKSegmentData},    {".text", RKSegmentUnset},
-        {"unknown", RKSegmentUnset},
-    };
-    for (const auto& [name, segment] : cases) EXPECT_EQ(image(0, 1, name)->segment, segment) << name;
-    auto kept = image(0, 1, "__TEXT");
-    kept->setName(RKUnsharedString(".data"));  // not a "__" name: the segment stays
-    EXPECT_EQ(kept->segment, RKSegmentText);
-}
 
 TEST(RKImage, EnumeratorOnlyMovesForwardAndSeesAppendedImages) {
     RKImageList images{image(0x1000, 0x1000), image(0x3000, 0x2000)};
@@ -64,36 +46,4 @@ TEST(RKImage, InternTablesShareOneStringAcrossThreadsAndOverflowToOwnCopies) {
     EXPECT_EQ(*overflow, "e");
     EXPECT_NE(overflow.get(), table.intern("e", 0, 4, 1024).get()) << "a full table hands out copies";
     EXPECT_EQ(*table.intern("bx", 0, 4, 1), "b") << "compared on the first `limit` bytes only";
-}
-
-TEST(RKImage, ImagesOfAProcessNameItsRegions) {
-    auto platform = std::make_shared<RKScriptedPlatform>();
-    RKScopedPlatform scoped(platform);
-    auto& tool = platform->addProcess(7, "tool");
-    RKRegionSubmapInfo file;
-    file.external_pager = 1;
-    for (uint64_t start : {0x10000, 0x12000, 0x14000, 0x20000})
-        tool.regions.push_back({start, 0x2000, file, RK_REGION_SUBMAP_INFO_COUNT, VM_PURGABLE_DENY, "/bin/tool", {}});
-    // Out of order, a header, a name with a space, and codes the platform sets itself.
-    tool.images = {
-        {"/bin/tool", 0x10000, 0x14000, 0x2000, ".data", RKSegmentData},
-        {"/bin/tool", 0x10000, 0x10000, 0x2000, "MACH_HEADER", 0},
-        {"/bin/tool", 0x10000, 0x12000, 0x2000, "__DATA_CONST extra words", 0},
-    };
-    auto process = std::dynamic_pointer_cast<RKUserProcess>(RKProcess::processWithPid(7));
-    ASSERT_TRUE(process);
-    process->gatherData();
-    const auto& regions = *process->memoryRegions();
-    ASSERT_EQ(regions.size(), 4u);
-    const std::pair<const char*, uint8_t> expected[] = {
-        {"__TEXT", RKSegmentText}, {"__DATA_CONST", RKSegmentData}, {".data", RKSegmentData},
-        {"mapped file", RKSegmentNoImage},  // a mapping of no image segment
-    };
-    for (size_t i = 0; i < regions.size(); i++) {
-        EXPECT_EQ(regions[i]->name, expected[i].first) << i;
-        EXPECT_EQ(regions[i]->segment, expected[i].second) << i;
-        EXPECT_EQ(regions[i]->detailedName, "/bin/tool") << i;
-    }
-    EXPECT_FALSE(process->images()) << "images are dropped after the walk";
-    RKAnalysisSettings::resetCache();
 }

@@ -1,17 +1,17 @@
 // Processes on scripted kernel answers: how a command line selects them (name and pid lookup,
-// descendants, exclusions, hidden extra targets, -s), and how the region walk of a live process
-// turns entries into regions (sizes, names, identity), ends, and reports failures.
-#include <gtest/gtest.h>
+// descendants, exclusions, hidden extra targets), a pid reused under it, and how the region walk
+// of a live process turns entries into regions (sizes, names, images, identity, owned objects),
+// ends, and reports failures.
+#include "RKScriptedToolTest.h"
 
 #include <array>
 #include <cstring>
+#include <tuple>
 
 #include "driver/RKMemspreadArgs.h"
 #include "model/RKMemoryRegion.h"
+#include "platform/RKLinuxOwnedObjects.h"
 #include "platform/RKLinuxTags.h"
-#include "platform/RKScriptedPlatform.h"
-#include "process/RKAnalysisSettings.h"
-#include "process/RKUserProcess.h"
 #include "support/RKKeptArgv.h"
 
 namespace {
@@ -19,45 +19,36 @@ namespace {
 using Keys = std::vector<int64_t>;
 constexpr uint64_t P = 4096;
 
-// An entry of `pages` pages at `start` answering the counters of `info` and purge state `purge`;
-// with a 64-bit object id made from its address.
-RKScriptedRegion entry(uint64_t start, uint64_t pages, RKRegionSubmapInfo info = {}, int purge = VM_PURGABLE_DENY) {
+// An entry of `pages` pages at `start` answering the counters of `info`, with an object id made
+// from its address.
+RKScriptedRegion entry(uint64_t start, uint64_t pages, RKRegionSubmapInfo info = {}) {
     RKScriptedRegion region;
     region.start = start;
     region.size = pages * P;
-    region.purgeState = purge;
     region.info = info;
     region.info.object_id_full = 0x4000000000000000ull | start;
-    region.info.object_id = static_cast<uint32_t>(start);
     return region;
+}
+
+// A memfd mapping of object `id`, and an owned-object record of one with a "buffer" detail.
+RKScriptedRegion memfd(uint64_t start, uint64_t pages, uint64_t id, RKRegionSubmapInfo info) {
+    RKScriptedRegion region = entry(start, pages, info);
+    region.info.user_tag = RKTagMemfd;
+    region.info.object_id_full = id;
+    return region;
+}
+RKOwnedVmObjectRecord record(uint64_t id, uint64_t resident, uint64_t compressed,
+                             uint32_t flags = VM_PURGABLE_DENY << 4) {
+    return {.object_id = id, .virtual_size = 64 * P, .resident_size = resident, .wired_size = P,
+            .reusable_size = P, .compressed_size = compressed, .flags = flags, .detail = "buffer"};
 }
 
 // Dirty, reclaimable, swapped and clean non-speculative bytes.
 using Sizes = std::array<uint64_t, 4>;
 Sizes sizes(const RKMemoryRegion& r) { return {r.dirtySize, r.reclaimableSize, r.swappedSize, r.cleanNonSpecSize}; }
 
-class RKProcessTest : public ::testing::Test {
+class RKProcessTest : public RKScriptedToolTest {
 protected:
-    RKProcessTest() {
-        platform->addProcess(0, "kernel", 0, PROC_FLAG_SYSTEM);
-        platform->addProcess(1, "init", 0);
-        platform->addProcess(7, "tool");
-        platform->selfPid = 600;
-    }
-    void TearDown() override { RKAnalysisSettings::resetCache(); }
-
-    RKScriptedProcess& tool() { return *platform->find(7); }
-    // Makes and gathers the tool, with or without the breakdown; `printed` is what it wrote.
-    std::shared_ptr<RKUserProcess> gathered(bool breakDown = false) {
-        platform->selfRegionValue = breakDown ? 1 : 0;
-        RKAnalysisSettings::resetCache();
-        testing::internal::CaptureStderr();
-        auto process = std::dynamic_pointer_cast<RKUserProcess>(RKProcess::processWithPid(7));
-        if (process) process->gatherData();
-        printed = testing::internal::GetCapturedStderr();
-        return process;
-    }
-
     // Resolves a command line (without the program name): the keys of its visible (or hidden)
     // targets; `printed` is what resolving wrote.
     Keys targets(std::vector<std::string> arguments, bool hidden = false, RKError* error = nullptr) {
@@ -71,10 +62,6 @@ protected:
             if (process->hiddenFromDisplay() == hidden) keys.push_back(key);
         return keys;
     }
-
-    std::shared_ptr<RKScriptedPlatform> platform = std::make_shared<RKScriptedPlatform>();
-    RKScopedPlatform scope{platform};
-    std::string printed;
 };
 
 }  // namespace
@@ -108,16 +95,12 @@ TEST_F(RKProcessTest, DescendantsGenerationByGenerationEachOnce) {
     EXPECT_EQ(targets({"-t", "0", "-x", "great"}), (Keys{0, 1, 2, 3, 4, 7, 9, 600}));
 }
 
-TEST_F(RKProcessTest, UnmappedHiddenTargetsAndIdleExitFilter) {
+TEST_F(RKProcessTest, UnmappedAddsEveryOtherProcessHidden) {
     platform->addProcess(5, "named");
-    platform->addProcess(6, "dirty").dirtyFlags = 0x7;  // tracked, may exit when idle, but dirty
-    platform->addProcess(8, "clean").dirtyFlags = PROC_DIRTY_TRACKED | PROC_DIRTY_ALLOWS_IDLE_EXIT;
     platform->addProcess(9, "excluded");
     platform->addProcess(600, "memspread");
-    EXPECT_EQ(targets({"--unmapped", "named", "-x", "excluded"}, true), (Keys{1, 6, 7, 8}))
+    EXPECT_EQ(targets({"--unmapped", "named", "-x", "excluded"}, true), (Keys{1, 7}))
         << "hidden: not the kernel, the exclusions or memspread";
-    EXPECT_EQ(targets({"--unmapped", "-s", "named"}, true), (Keys{1, 6, 7, 9}));
-    EXPECT_EQ(targets({"-a", "-s"}), (Keys{0, 1, 5, 6, 7, 9}));
 }
 
 TEST_F(RKProcessTest, ErrorsAndUnanalyzableTargets) {
@@ -132,10 +115,9 @@ TEST_F(RKProcessTest, ErrorsAndUnanalyzableTargets) {
                        "Unable to analyze process with pid 77 (try as root?)\n");
 }
 
-TEST_F(RKProcessTest, EntriesBecomeNamedRegionsOnce) {
+TEST_F(RKProcessTest, EntriesBecomeNamedRegions) {
     auto memfd = entry(0x40000, 2, {.user_tag = RKTagMemfd});
     memfd.path = "buffer";  // the platform's detail of a tagged region, not a file path
-    memfd.count = 18;       // an older record without the 64-bit object id
     auto unreadable = entry(0x30000, 4, {.external_pager = 1});  // a file whose path cannot be read
     tool().regions = {entry(0x10000, 4), unreadable, memfd};
 
@@ -145,18 +127,32 @@ TEST_F(RKProcessTest, EntriesBecomeNamedRegionsOnce) {
     EXPECT_EQ(list[0]->object_id, 0x4000000000010000ull);
     EXPECT_EQ(list[1]->fullName(), "mapped file") << "no path, no detail";
     EXPECT_EQ(list[2]->fullName(), "memfd buffer") << "a detail does not make a region a mapped file";
-    EXPECT_EQ(list[2]->object_id, 0x40000u) << "18 words: the 32-bit id stands in";
-
-    size_t walkCalls = platform->callCount("regionRecurse");
-    process->gatherData();
-    EXPECT_EQ(platform->callCount("regionRecurse"), walkCalls) << "a second gather reads nothing";
     EXPECT_EQ(printed, "");
 }
 
-TEST_F(RKProcessTest, SizesFollowPurgeStateAndBreakdown) {
+// Images, out of order as the Linux platform lists them, name the file regions they hold.
+TEST_F(RKProcessTest, ImagesNameTheRegionsTheyHold) {
+    RKRegionSubmapInfo file;
+    file.external_pager = 1;
+    for (uint64_t start : {0x10000, 0x12000, 0x14000, 0x20000})
+        tool().regions.push_back({start, 0x2000, file, RK_REGION_SUBMAP_INFO_COUNT, VM_PURGABLE_DENY, "/bin/tool", {}});
+    tool().images = {{"/bin/tool", 0x10000, 0x14000, 0x2000, ".data", RKSegmentData},
+                     {"/bin/tool", 0x10000, 0x10000, 0x2000, ".text", RKSegmentText},
+                     {"/bin/tool", 0x10000, 0x12000, 0x2000, ".rodata", RKSegmentLinkedit}};
+    auto process = gathered();
+    std::vector<std::tuple<std::string, uint8_t, std::string>> regions;
+    for (const auto& region : *process->memoryRegions())
+        regions.emplace_back(region->name, region->segment, region->detailedName);
+    EXPECT_EQ(regions, (std::vector<std::tuple<std::string, uint8_t, std::string>>{
+                           {".text", RKSegmentText, "/bin/tool"},
+                           {".rodata", RKSegmentLinkedit, "/bin/tool"},
+                           {".data", RKSegmentData, "/bin/tool"},
+                           {"mapped file", RKSegmentNoImage, "/bin/tool"}}));  // of no image segment
+    EXPECT_FALSE(process->images()) << "images are dropped after the walk";
+}
+
+TEST_F(RKProcessTest, SizesFollowTheBreakdown) {
     tool().regions = {
-        entry(0x10000, 8, {.pages_resident = 3, .pages_dirtied = 3}, VM_PURGABLE_EMPTY),
-        entry(0x20000, 8, {.pages_resident = 3, .pages_dirtied = 3}, VM_PURGABLE_VOLATILE),
         entry(0x30000, 8,
               {.pages_resident = 6, .pages_swapped_out = 2, .pages_dirtied = 1, .user_wired_count = 1,
                .pages_reusable = 2}),
@@ -168,37 +164,29 @@ TEST_F(RKProcessTest, SizesFollowPurgeStateAndBreakdown) {
         SCOPED_TRACE(breakDown ? "breakdown on" : "breakdown off");
         auto process = gathered(breakDown);
         const auto& list = *process->memoryRegions();
-        ASSERT_EQ(list.size(), 5u);
-        EXPECT_EQ(sizes(*list[0]), (Sizes{0, 8 * P, 0, 0})) << "emptied: all of it reclaimable";
-        EXPECT_EQ(sizes(*list[1]), (Sizes{0, 3 * P, 0, 0})) << "volatile: what is resident";
+        ASSERT_EQ(list.size(), 3u);
         // Anonymous: without the breakdown every resident page that is not reusable is dirty.
-        EXPECT_EQ(sizes(*list[2]), breakDown ? (Sizes{1 * P, 2 * P, 2 * P, 3 * P}) : (Sizes{4 * P, 2 * P, 2 * P, 0}));
-        EXPECT_TRUE(list[2]->wired);
-        EXPECT_EQ(sizes(*list[3]), (Sizes{2 * P, 1 * P, 0, 2 * P})) << "files count what was dirtied";
-        EXPECT_EQ(sizes(*list[4]), (Sizes{breakDown ? 2 * P : 0, 3 * P, 0, 0}));
+        EXPECT_EQ(sizes(*list[0]), breakDown ? (Sizes{1 * P, 2 * P, 2 * P, 3 * P}) : (Sizes{4 * P, 2 * P, 2 * P, 0}));
+        EXPECT_TRUE(list[0]->wired);
+        EXPECT_EQ(sizes(*list[1]), (Sizes{2 * P, 1 * P, 0, 2 * P})) << "files count what was dirtied";
+        EXPECT_EQ(sizes(*list[2]), (Sizes{breakDown ? 2 * P : 0, 3 * P, 0, 0}));
     }
 }
 
-TEST_F(RKProcessTest, OwnedPseudoRegionEndsTheWalkAndPageTablesFollowIt) {
-    auto pseudo = entry(0x20000, 4, {.user_tag = RK_OWNED_MEMORY_TAG, .pages_resident = 3, .pages_dirtied = 3});
-    pseudo.info.object_id_full = 0;
-    tool().regions = {entry(0x10000, 1), pseudo, entry(0x30000, 1)};
+// The page tables are a region of their own, from the ledger, with the breakdown only.
+TEST_F(RKProcessTest, PageTablesComeFromTheLedger) {
+    tool().regions = {entry(0x10000, 1)};
     tool().ledgerBalances = {3 * static_cast<int64_t>(P)};
-    EXPECT_EQ(gathered()->memoryRegions()->size(), 2u) << "no page table without the breakdown";
-
+    EXPECT_EQ(gathered()->memoryRegions()->size(), 1u) << "no page table without the breakdown";
     auto process = gathered(true);
     const auto& list = *process->memoryRegions();
-    ASSERT_EQ(list.size(), 3u) << "nothing after the pseudo-region is examined";
-    EXPECT_EQ(list[1]->fullName(), "Owned physical memspread (unmapped)");
-    EXPECT_EQ(list[1]->start, RKRegionNoAddress) << "owned but unmapped: no address";
+    ASSERT_EQ(list.size(), 2u);
+    EXPECT_EQ(list[1]->fullName(), "page table");
     EXPECT_EQ(sizes(*list[1]), (Sizes{3 * P, 0, 0, 0}));
-    EXPECT_EQ(list[1]->object_id, 0x20000u) << "no 64-bit id: the 32-bit one";
-    EXPECT_EQ(list[2]->fullName(), "page table");
-    EXPECT_EQ(sizes(*list[2]), (Sizes{3 * P, 0, 0, 0}));
-    EXPECT_EQ(list[2]->object_id, ~0ull);
+    EXPECT_EQ(list[1]->object_id, ~0ull);
 
     tool().ledgerBalances = {-5};
-    EXPECT_EQ(gathered(true)->memoryRegions()->size(), 2u) << "a negative balance is no page table";
+    EXPECT_EQ(gathered(true)->memoryRegions()->size(), 1u) << "a negative balance is no page table";
     tool().ledgerErrno = EPERM;
     const std::string warning = "tool [7]: Unable to retrieve ledger entry info - Operation not permitted";
     EXPECT_EQ(gathered(true)->warnings(), std::vector<std::string>{warning});
@@ -223,4 +211,45 @@ TEST_F(RKProcessTest, FailedWalkKeepsRegionsAndTellsExitFromError) {
     EXPECT_EQ(gathered()->errors(), std::vector<std::string>{"tool [7]: process is gone"});
     tool().walkEnd = KERN_FAILURE;
     EXPECT_EQ(gathered()->errors(), std::vector<std::string>{"tool [7]: failure"});
+}
+
+// An object mapped twice and listed once is charged once, from its record; one nobody maps
+// becomes a region without an address.
+TEST_F(RKProcessTest, ListedObjectsAreChargedOnceFromTheirRecords) {
+    tool().ownedErrno = 0;
+    tool().regions = {memfd(0x10000, 4, 0x8000000000000011, {.pages_resident = 4, .pages_dirtied = 1}),
+                      memfd(0x20000, 4, 0x8000000000000011, {.pages_resident = 4, .pages_dirtied = 4}),
+                      memfd(0x30000, 2, 0x4000000000000033, {.pages_resident = 2, .pages_dirtied = 2})};
+    tool().owned = {record(0x8000000000000011, 10 * P, 2 * P, VM_PURGABLE_DENY << 4 | RKLedgerTagGraphics << 1),
+                    record(0x8000000000000022, 6 * P, 3 * P)};
+    auto process = gathered(true);
+    const RKRegionList& regions = *process->memoryRegions();
+    ASSERT_EQ(regions.size(), 4u);
+
+    // Owned, name, dirty, swapped, clean and reclaimable bytes.
+    auto row = [](const RKMemoryRegion& r) {
+        return std::tuple(r.ownedExclusivelyByParentProcess, r.fullName(), r.dirtySize, r.swappedSize,
+                          r.cleanNonSpecSize, r.reclaimableSize);
+    };
+    EXPECT_EQ(row(*regions[0]), std::tuple(true, "memfd (graphics)", 9 * P, 2 * P, 0u, P)) << "resident less reusable";
+    EXPECT_EQ(row(*regions[1]), std::tuple(true, "memfd", 0u, 0u, 0u, 0u)) << "the object is already charged whole";
+    EXPECT_EQ(row(*regions[2]), std::tuple(false, "memfd", 2 * P, 0u, 0u, 0u)) << "not listed: its own counters";
+    const RKMemoryRegion& unmapped = *regions[3];
+    EXPECT_EQ(row(unmapped), std::tuple(true, "Owned physical memspread (unmapped) buffer", 5 * P, 3 * P, 0u, P));
+    EXPECT_TRUE(unmapped.start == RKRegionNoAddress && unmapped.size == 64 * P && unmapped.share_mode == SM_SHARED);
+    EXPECT_TRUE(unmapped.wired && unmapped.isFake());
+}
+
+// The breakdown off asks for no list; a list that cannot be read is a warning.
+TEST_F(RKProcessTest, TheListIsAskedWithTheBreakdownOnlyAndAnUnreadableOneWarns) {
+    tool().regions = {entry(0x10000, 4, {.pages_resident = 2, .pages_dirtied = 1})};
+    gathered(false);
+    EXPECT_EQ(platform->callCount("ownedVmObjects"), 0u);
+    tool().ownedErrno = EACCES;
+    EXPECT_EQ(gathered(true)->warnings(), std::vector<std::string>{
+        "tool [7]: descriptors cannot be read without root - memory held through them is not counted"});
+    tool().ownedErrno = EIO;
+    const std::string warning = "tool [7]: vm.get_owned_vmobjects - Input/output error";
+    EXPECT_EQ(gathered(true)->warnings(), std::vector<std::string>{warning});
+    EXPECT_EQ(printed, warning + "\n");
 }

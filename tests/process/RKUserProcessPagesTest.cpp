@@ -1,13 +1,12 @@
-// Page dispositions of a live process on scripted kernel answers: chunking, sizing a region
-// from dispositions with the page it shares with its neighbours, subranges, and which regions
-// the walk reads page data for.
-#include <gtest/gtest.h>
+// Page dispositions of a live process on scripted kernel answers: sizing a region from
+// dispositions (holes never asked about, the page it shares with its neighbour), subranges, which
+// regions the walk reads page data for, and the shared region's pieces.
+#include "RKScriptedToolTest.h"
+
+#include <tuple>
 
 #include "model/RKMemoryRegion.h"
 #include "model/RKRangeList.h"
-#include "platform/RKScriptedPlatform.h"
-#include "process/RKAnalysisSettings.h"
-#include "process/RKUserProcess.h"
 
 namespace {
 
@@ -24,50 +23,15 @@ std::shared_ptr<RKMemoryRegion> regionOf(uint64_t start, uint64_t end) {
     return region;
 }
 
-class RKUserProcessPagesTest : public ::testing::Test {
+class RKUserProcessPagesTest : public RKScriptedToolTest {
 protected:
-    RKUserProcessPagesTest() {
-        platform->addProcess(7, "tool");
-        platform->selfPid = 600;
-    }
-    void TearDown() override { RKAnalysisSettings::resetCache(); }
-
-    RKScriptedProcess& tool() { return *platform->find(7); }
     std::shared_ptr<RKUserProcess> process(bool gather = false, bool breakDown = true) {
-        platform->selfRegionValue = breakDown ? 1 : 0;
-        RKAnalysisSettings::resetCache();
-        testing::internal::CaptureStderr();
-        auto made = std::dynamic_pointer_cast<RKUserProcess>(RKProcess::processWithPid(7));
-        if (made && gather) made->gatherData();
-        // The steps called one by one read through the task that gathering would hold open.
-        if (made && !gather) made->_reopenTaskForGathering();
-        printed = testing::internal::GetCapturedStderr();
-        return made;
+        return made(7, breakDown, gather);
     }
     void script(uint64_t address, std::initializer_list<uint32_t> dispositions) {
         for (uint32_t d : dispositions) tool().dispositions[address] = d, address += P;
     }
-
-    std::shared_ptr<RKScriptedPlatform> platform = std::make_shared<RKScriptedPlatform>();
-    RKScopedPlatform scope{platform};
-    std::string printed;
 };
-
-TEST_F(RKUserProcessPagesTest, ChunksOf4096PagesAndHolesWhole) {
-    for (uint64_t i = 0; i < 4097; i++) tool().dispositions[0x100000 + i * P] = kPresent;
-    tool().dispositions[0x100000 + 10000 * P] = kPresent;
-    auto tool = process();
-    for (uint64_t pages : {0ull, 4096ull, 10001ull}) {
-        std::vector<std::array<uint64_t, 3>> pieces;  // has dispositions, first, count
-        EXPECT_TRUE(tool->_enumerateDispositionChunks(0x100000, pages, [&](const uint32_t* d, uint64_t first, uint64_t n) {
-            pieces.push_back({d != nullptr, first, n});
-        }));
-        std::vector<std::array<uint64_t, 3>> expected;
-        if (pages == 4096) expected = {{1, 0, 4096}};
-        if (pages == 10001) expected = {{1, 0, 4096}, {1, 4096, 1}, {0, 4097, 5903}, {1, 10000, 1}};
-        EXPECT_EQ(pieces, expected) << pages;
-    }
-}
 
 // A terabyte reserved and barely touched (a sanitizer's shadow, a runtime's heap) costs its
 // pages: sized and split exactly, with the holes never asked about. Its partial first and last
@@ -98,21 +62,6 @@ TEST_F(RKUserProcessPagesTest, SparseTerabyteCostsItsPagesOnly) {
     EXPECT_EQ(platform->callCount("pageRangeQuery"), 6u);
 }
 
-TEST_F(RKUserProcessPagesTest, UnusedSharedCacheRegionTakesItsPartOfTheCommonPage) {
-    script(0x10000, {kPresent | kFile | kDirty, kPresent | kFile | kDirty});
-    auto tool = process();
-    auto unused = regionOf(0xE000, 0x10800);
-    unused->unusedSharedCacheRegion = true;
-    EXPECT_TRUE(tool->_populateMemoryRegionWithPageQueries(*unused, {}));
-    EXPECT_EQ(platform->callCount("pageRangeQuery"), 0u) << "an unused region is never queried";
-    EXPECT_EQ(unused->dirtySize, 0u);
-
-    auto image = regionOf(0x10800, 0x12000);
-    EXPECT_TRUE(tool->_populateMemoryRegionWithPageQueries(*image, {}));
-    EXPECT_EQ(image->dirtySize, 0x800 + P);
-    EXPECT_EQ(unused->dirtySize, 0x800u) << "its bytes of page 0x10000";
-}
-
 TEST_F(RKUserProcessPagesTest, SubrangesAreRunsOfLikePagesInObjectOffsets) {
     script(0x10000, {kPresent | kDirty, kPresent | kDirty, 0, kPresent});
     auto tool = process();
@@ -125,14 +74,57 @@ TEST_F(RKUserProcessPagesTest, SubrangesAreRunsOfLikePagesInObjectOffsets) {
                                                    {0x100000 + 3 * P, P, P, 0, 0, 0, 0},
                                                }));
 
-    // Wired regions are wired in every run; a volatile region's present pages are reclaimable.
+    // Wired regions are wired in every run.
     auto wired = regionOf(0x10000, 0x14000);
     wired->wired = true;
-    tool->_addSubrangesForRegion(*wired, VM_PURGABLE_VOLATILE);
+    tool->_addSubrangesForRegion(*wired, VM_PURGABLE_DENY);
     RKMemoryTotal sum = wired->subrangeList()->sum();
-    EXPECT_EQ(sum.dirty, 2 * P);
-    EXPECT_EQ(sum.reclaimable, P);
-    EXPECT_EQ(sum.wired, 3 * P);
+    EXPECT_EQ(std::pair(sum.dirty, sum.wired), std::pair(2 * P, 3 * P));
+}
+
+// The shared region of a system that has one (Linux has none; snapshots of such systems reach
+// this code) is cut at image segments: a gap takes the segment that ends in its first page, else
+// the one that starts in its last, and a page two pieces share counts once. A failed page query
+// stops the walk.
+TEST_F(RKUserProcessPagesTest, SharedRegionIsCutAtSegmentsAndAPageTwoPiecesShareCountsOnce) {
+    constexpr uint64_t base = 0x180000000;  // arm64's
+    platform->sharedRegion = true;
+    RKScriptedRegion below, mapping;
+    below.start = 0x100000, below.size = P;
+    mapping.start = base, mapping.size = 0x10 * P, mapping.basic.offset = 0x40000;
+    tool().regions = {below, mapping};
+    // Unaligned neighbours: data [0x1000, 0x1800), a gap to 0x2400, data [0x2400, 0x3000), a gap,
+    // text at 0x4800. Pages 0x1000 and 0x2000 are dirty.
+    tool().images = {{"/usr/lib/libA.dylib", base, base + 0x1000, 0x800, "__DATA", 0},
+                     {"/usr/lib/libB.dylib", base, base + 0x2400, 0xc00, "__DATA", 0},
+                     {"/usr/lib/libC.dylib", base, base + 0x4800, 0x800, "__TEXT", 0}};
+    script(base + 0x1000, {kPresent | kDirty, kPresent | kDirty});
+    auto pieces = [&] {
+        using Piece = std::tuple<uint64_t, uint64_t, std::string, uint8_t, uint64_t>;  // and dirty bytes
+        std::vector<Piece> result;
+        auto gathered = process(true);
+        for (const auto& region : *gathered->memoryRegions()) {
+            if (!region->inSharedCache) continue;
+            EXPECT_EQ(region->offset, 0x40000 + region->start - base) << "offsets follow the mapping's";
+            result.emplace_back(region->start - base, region->end() - base, region->name, region->segment,
+                                region->dirtySize);
+        }
+        return result;
+    };
+    const std::string unused = "unused lodr shared cache area";
+    EXPECT_EQ(pieces(), (std::vector<std::tuple<uint64_t, uint64_t, std::string, uint8_t, uint64_t>>{
+                            {0, 0x1000, unused, RKSegmentData, 0},
+                            {0x1000, 0x1800, "__DATA", RKSegmentData, 0x800},
+                            // 0x800 of page 0x1000 from the cache, 0x400 of page 0x2000 when libB asks
+                            {0x1800, 0x2400, unused, RKSegmentData, 0xc00},
+                            {0x2400, 0x3000, "__DATA", RKSegmentData, 0xc00},
+                            {0x3000, 0x4800, unused, RKSegmentData, 0},
+                            {0x4800, 0x5000, "__TEXT", RKSegmentText, 0},
+                            {0x5000, 0x10 * P, unused, RKSegmentText, 0}}));
+
+    tool().pageQueryResult = KERN_FAILURE;
+    EXPECT_EQ(pieces().size(), 1u) << "the unused area before the first image; the failed piece is dropped";
+    EXPECT_NE(printed.find("bailing out for process tool [7]; data may be incomplete!"), std::string::npos) << printed;
 }
 
 TEST_F(RKUserProcessPagesTest, ProcessThatExitedBeforeItsPageQuery) {
@@ -167,11 +159,10 @@ TEST_F(RKUserProcessPagesTest, PageDataIsReadOnceForEligibleRegions) {
     auto gathered = process(true);
     ASSERT_EQ(tool().preparedRanges.size(), 2u) << "read once, then released";
     EXPECT_TRUE(tool().preparedRanges[1].empty());
-    const auto& ranges = tool().preparedRanges[0];
-    ASSERT_EQ(ranges.size(), 2u) << "not the private one, nor the one all dirty";
-    EXPECT_EQ(ranges[0].start, 0x10000u);
-    EXPECT_EQ(ranges[1].start, 0x40000u);
-    EXPECT_TRUE(ranges[1].fileBacked);
+    std::vector<std::pair<uint64_t, bool>> ranges;  // start, file-backed
+    for (const auto& range : tool().preparedRanges[0]) ranges.emplace_back(range.start, range.fileBacked);
+    EXPECT_EQ(ranges, (std::vector<std::pair<uint64_t, bool>>{{0x10000, false}, {0x40000, true}}))
+        << "not the private one, nor the one all dirty";
     EXPECT_EQ((*gathered->memoryRegions())[3]->subrangeList()->sum().dirty, P);
 
     platform->pageAbilities.dirtyFilePages = false;

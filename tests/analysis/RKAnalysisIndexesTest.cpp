@@ -1,11 +1,13 @@
-// Ranks are the keys' places in ascending order with no gaps: across words and chunks of the
-// frame bitmap, repeated keys, and swap entries after every frame.
+// The analysis's own indexes. Ranks are the keys' places in ascending order with no gaps: across
+// words and chunks of the frame bitmap, repeated keys, and swap entries after every frame. Each
+// pointer is new to the pointer set once, through the growths of its table.
 #include <gtest/gtest.h>
 
 #include <algorithm>
 #include <vector>
 
 #include "analysis/RKPageKeyRanks.h"
+#include "analysis/RKPointerSet.h"
 #include "platform/RKKernelTypes.h"
 
 TEST(RKPageKeyRanks, RanksAreAscendingPlacesOfTheDistinctKeys) {
@@ -19,4 +21,12 @@ TEST(RKPageKeyRanks, RanksAreAscendingPlacesOfTheDistinctKeys) {
     distinct.erase(std::unique(distinct.begin(), distinct.end()), distinct.end());
     ASSERT_EQ(ranks.size(), distinct.size());
     for (size_t i = 0; i < distinct.size(); i++) EXPECT_EQ(ranks.rank(distinct[i]), i) << distinct[i];
+}
+
+TEST(RKPointerSet, EachPointerIsNewOnceThroughGrowth) {
+    std::vector<long> objects(5000);
+    RKPointerSet set(10);
+    for (const long& object : objects) EXPECT_TRUE(set.insert(&object));
+    for (size_t i = 0; i < objects.size(); i += 7) EXPECT_FALSE(set.insert(&objects[i]));
+    EXPECT_EQ(set.size(), objects.size());
 }
