@@ -14,9 +14,25 @@ const std::string kNoName;
 }  // namespace
 
 // Nearly one per mapping: see RKMemoryRegion.cpp.
-static_assert(sizeof(void*) != 8 || sizeof(RKMemoryObject) <= 120);
+static_assert(sizeof(void*) != 8 || sizeof(RKMemoryObject) <= 104);
 
 RKMemoryObject::RKMemoryObject() = default;
+
+RKRangeList* RKMemoryObject::_rangeList() const {
+    const RKObjectRegions::Extras* extras = memoryRegions_.extras();
+    return extras ? extras->rangeList.get() : nullptr;
+}
+
+RKProcessRegionMap* RKMemoryObject::_processRegions() const {
+    const RKObjectRegions::Extras* extras = memoryRegions_.extras();
+    return extras ? extras->processRegions.get() : nullptr;
+}
+
+RKObjectRegions::Extras& RKMemoryObject::_extras() {
+    RKObjectRegions::Extras* extras = memoryRegions_.extras();
+    RKAssert(extras != nullptr, "RKMemoryObject", "range list or process views with fewer than two regions");
+    return *extras;
+}
 
 RKMemoryObject::~RKMemoryObject() {
     // A view or a copy shares regions that point elsewhere; forgetting checks.
@@ -42,17 +58,20 @@ void RKMemoryObject::_addRegion(const std::shared_ptr<RKMemoryRegion>& region, u
     if (process) _addToProcessViews(region, process->pid());
     // Most objects have one region: its range list is built only when a second one comes, or
     // for a moment when the object is finalized.
-    if (!rangeList_ && soleRegion_ == kNone) {
+    RKRangeList* rangeList = _rangeList();
+    if (!rangeList && soleRegion_ == kNone) {
         RKAssert(pageSize <= UINT32_MAX, "RKMemoryObject", "page size within 32 bits");
         soleRegion_ = static_cast<uint32_t>(memoryRegions_.size() - 1);
         soleRegionPageSize_ = static_cast<uint32_t>(pageSize);
         return;
     }
-    if (!rangeList_) {
-        rangeList_ = std::make_unique<RKRangeList>();
-        _mergeSoleRegion(*rangeList_);
+    if (!rangeList) {
+        std::unique_ptr<RKRangeList>& made = _extras().rangeList;
+        made = std::make_unique<RKRangeList>();
+        rangeList = made.get();
+        _mergeSoleRegion(*rangeList);
     }
-    rangeList_->addRegion(*region, pageSize);
+    rangeList->addRegion(*region, pageSize);
     region->freeSubrangeList();
 }
 
@@ -66,14 +85,17 @@ void RKMemoryObject::_addToProcessViews(const std::shared_ptr<RKMemoryRegion>& r
         viewsPid_ = pid;
         return;
     }
-    if (!processMemoryRegions_) {
+    RKProcessRegionMap* views = _processRegions();
+    if (!views) {
         if (pid == viewsPid_) return;
-        processMemoryRegions_ = std::make_unique<RKProcessRegionMap>();
-        RKRegionList& first = (*processMemoryRegions_)[viewsPid_];
+        std::unique_ptr<RKProcessRegionMap>& made = _extras().processRegions;
+        made = std::make_unique<RKProcessRegionMap>();
+        views = made.get();
+        RKRegionList& first = (*views)[viewsPid_];
         for (size_t i = viewsFrom_; i + 1 < memoryRegions_.size(); i++)
             if (memoryRegions_[i]->object_id != 0) first.push_back(memoryRegions_[i]);
     }
-    (*processMemoryRegions_)[pid].push_back(region);
+    (*views)[pid].push_back(region);
 }
 
 void RKMemoryObject::_mergeSoleRegion(RKRangeList& into) {
@@ -90,8 +112,8 @@ void RKMemoryObject::finalizeUsingRegionDirtySize(bool useRegionDirtySize) {
         RKRangeList sole;
         _mergeSoleRegion(sole);
         merged = sole.sum();
-    } else if (rangeList_) {
-        merged = rangeList_->sum();
+    } else if (const RKRangeList* rangeList = _rangeList()) {
+        merged = rangeList->sum();
     }
 
     if (useRegionDirtySize) {
@@ -109,9 +131,10 @@ void RKMemoryObject::finalizeUsingRegionDirtySize(bool useRegionDirtySize) {
     totalCleanSize_ = merged.clean;
     totalReclaimableSize_ = merged.reclaimable;
     totalWiredSize_ = merged.wired;
-    rangeList_.reset();
-
-    if (processMemoryRegions_ && !_keepsProcessViews()) processMemoryRegions_.reset();
+    if (RKObjectRegions::Extras* extras = memoryRegions_.extras()) {
+        extras->rangeList.reset();
+        if (extras->processRegions && !_keepsProcessViews()) extras->processRegions.reset();
+    }
     viewsFrom_ = kNone;
     if (containsFakeRegion_) _nameFakeRegions();
     accurateSizes_ = true;
@@ -130,18 +153,20 @@ void RKMemoryObject::_raiseToProcessSums() {
         totalDirtySize_ = std::max(totalDirtySize_, dirty);
         totalSwappedSize_ = std::max(totalSwappedSize_, swapped);
     };
-    if (!processMemoryRegions_) {
+    const RKProcessRegionMap* views = _processRegions();
+    if (!views) {
         raise(std::span(memoryRegions_).subspan(viewsFrom_));
         return;
     }
-    for (const auto& [pid, regions] : *processMemoryRegions_) raise(regions);
+    for (const auto& [pid, regions] : *views) raise(regions);
 }
 
 // Views can differ only when two or more processes map the object and at least one of them
 // does not see it whole through a single region.
 bool RKMemoryObject::_keepsProcessViews() const {
-    if (processMemoryRegions_->size() < 2) return false;
-    for (const auto& [pid, regions] : *processMemoryRegions_) {
+    const RKProcessRegionMap& views = *_processRegions();
+    if (views.size() < 2) return false;
+    for (const auto& [pid, regions] : views) {
         if (regions.size() != 1) return true;
         const RKMemoryRegion& region = *regions.front();
         bool seesWhole = region.dirtySize == totalDirtySize_ && region.swappedSize == totalSwappedSize_ &&
@@ -164,7 +189,7 @@ void RKMemoryObject::_nameFakeRegions() {
 }
 
 std::shared_ptr<RKMemoryObject> RKMemoryObject::copy() const {
-    RKAssert(accurateSizes_ && !rangeList_, "RKMemoryObject", "copy of a memory object that is not finalized");
+    RKAssert(accurateSizes_ && !_rangeList(), "RKMemoryObject", "copy of a memory object that is not finalized");
     auto copied = std::make_shared<RKMemoryObject>();
     copied->totalDirtySize_ = totalDirtySize_;
     copied->totalSwappedSize_ = totalSwappedSize_;
@@ -179,9 +204,9 @@ std::shared_ptr<RKMemoryObject> RKMemoryObject::copy() const {
 
 std::shared_ptr<RKMemoryObject> RKMemoryObject::viewForProcess(const RKProcess& process) {
     std::shared_ptr<RKMemoryObject> view = shared_from_this();
-    if (processMemoryRegions_ && !processMemoryRegions_->empty()) {
-        auto own = processMemoryRegions_->find(process.pid());
-        if (own == processMemoryRegions_->end()) return view;  // whole, whoever owns it
+    if (const RKProcessRegionMap* views = _processRegions(); views && !views->empty()) {
+        auto own = views->find(process.pid());
+        if (own == views->end()) return view;  // whole, whoever owns it
         view = std::make_shared<RKMemoryObject>();
         view->ownerPid_ = ownerPid_;
         for (const auto& region : own->second) view->addRegion(region, process.pageSize());
@@ -227,5 +252,6 @@ std::string RKMemoryObject::fullName() const {
 bool RKMemoryObject::verbose() const { return !memoryRegions_.empty() && memoryRegions_.front()->verbose; }
 
 bool RKMemoryObject::couldHaveProcessView() const {
-    return (processMemoryRegions_ && !processMemoryRegions_->empty()) || ownerPid_ != -1;
+    const RKProcessRegionMap* views = _processRegions();
+    return (views && !views->empty()) || ownerPid_ != -1;
 }

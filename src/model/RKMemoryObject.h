@@ -12,7 +12,6 @@
 #include <sys/types.h>
 
 #include <cstdint>
-#include <map>
 #include <memory>
 #include <optional>
 #include <string>
@@ -20,9 +19,6 @@
 #include "model/RKObjectRegions.h"
 #include "model/RKRangeList.h"
 #include "process/RKProcess.h"
-
-// The regions of each process (by pid) that map one object.
-using RKProcessRegionMap = std::map<pid_t, RKRegionList>;
 
 class RKMemoryObject : public std::enable_shared_from_this<RKMemoryObject> {
 public:
@@ -64,7 +60,8 @@ public:
     void setOwnerPid(pid_t pid) { ownerPid_ = pid; }
 
     const RKObjectRegions& memoryRegions() const { return memoryRegions_; }
-    const RKProcessRegionMap* processMemoryRegions() const { return processMemoryRegions_.get(); }
+    // Per process, while two or more have regions since the views began (see RKObjectRegions).
+    const RKProcessRegionMap* processMemoryRegions() const { return _processRegions(); }
 
     // Names come from the canonical region; empty for an object without regions.
     const std::string& name() const;
@@ -77,22 +74,27 @@ public:
     const RKMemoryRegion* _canonicalRegion() const;
 
 private:
+    // Held in the regions' extras (see RKObjectRegions), so null while there is one region.
+    RKRangeList* _rangeList() const;
+    RKProcessRegionMap* _processRegions() const;
+    // The extras, which the second region made; stops the program when there are none.
+    RKObjectRegions::Extras& _extras();
     bool _keepsProcessViews() const;
     void _raiseToProcessSums();
     void _nameFakeRegions();
     void _mergeSoleRegion(RKRangeList& into);
     void _addToProcessViews(const std::shared_ptr<RKMemoryRegion>& region, pid_t pid);
 
-    // One object per mapping at most: widest fields first, counts and indexes in 32 bits.
+    // One object per mapping at most: widest fields first, counts and indexes in 32 bits, and
+    // what only objects of two or more regions need (the range list, the per-process regions) in
+    // the block that their second region brings. 104 bytes: with the shared_ptr control block and
+    // glibc's header, a 128-byte chunk.
     uint64_t totalDirtySize_ = 0;
     uint64_t totalCleanSize_ = 0;
     uint64_t totalSwappedSize_ = 0;
     uint64_t totalReclaimableSize_ = 0;
     uint64_t totalWiredSize_ = 0;
     RKObjectRegions memoryRegions_;
-    // Per process, while two or more have regions since the views began.
-    std::unique_ptr<RKProcessRegionMap> processMemoryRegions_;
-    std::unique_ptr<RKRangeList> rangeList_;
     pid_t ownerPid_ = -1;
     static constexpr uint32_t kNone = UINT32_MAX;
     uint32_t viewsFrom_ = kNone;  // in memoryRegions_, until finalized
