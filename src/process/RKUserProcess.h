@@ -15,6 +15,7 @@
 #include "platform/RKPlatform.h"
 #include "platform/RKSharedPageList.h"
 #include "process/RKProcess.h"
+#include "process/RKRegionBlocks.h"
 
 class RKImage;
 class RKImageEnumerator;
@@ -44,6 +45,8 @@ using RKDispositionChunkBlock = std::function<void(const uint32_t* dispositions,
 
 // What one region-building pass carries from region to region and into the steps after it.
 struct RKRegionWalkState {
+    // Where every region of the pass is made (one per mapping): see RKRegionBlocks.h.
+    RKRegionBlocks regionBlocks;
     RKRegionList regions;
     // The region made of the kernel's owned-memory pseudo-region, kept out of `regions` until
     // it has been reduced by the owned memory found mapped.

@@ -92,7 +92,7 @@ void RKUserProcess::_addUnconsumedOwnedObjectRegions(RKRegionWalkState& state) {
     if (!ownedVmObjects_) return;
     const std::string unmappedName = RKMemoryRegion::categoryNameForTag(RK_OWNED_MEMORY_TAG);
     for (const auto& [id, record] : *ownedVmObjects_) {
-        auto region = std::make_shared<RKMemoryRegion>();
+        auto region = state.regionBlocks.make();
         region->object_id = id;
         region->ownedExclusivelyByParentProcess = true;
         region->user_tag = RK_OWNED_MEMORY_TAG;
@@ -131,6 +131,8 @@ void RKUserProcess::_reconcileUnmappedOwnedRegion(RKRegionWalkState& state) {
     if (unmapped->dirtySize + unmapped->swappedSize != 0) {
         unmapped->start = RKRegionNoAddress;
         state.regions.push_back(unmapped);
+    } else {
+        unmapped->freeSubrangeList();  // the region stays in its block until the block goes
     }
     unmapped.reset();
 }

@@ -16,9 +16,9 @@ constexpr const char* kLinkeditDetail = "lodr shared cache";
 bool neverPrivate(uint8_t segment) { return segment == RKSegmentText || segment == RKSegmentLinkedit; }
 
 // A piece of the mapping [mappingStart, ...) described by `info`, with its identity.
-std::shared_ptr<RKMemoryRegion> piece(uint64_t start, uint64_t end, uint64_t mappingStart,
+std::shared_ptr<RKMemoryRegion> piece(RKRegionBlocks& blocks, uint64_t start, uint64_t end, uint64_t mappingStart,
                                       const RKRegionSubmapInfo& info) {
-    auto region = std::make_shared<RKMemoryRegion>();
+    auto region = blocks.make();
     region->start = start;
     region->setEnd(end);
     region->user_tag = info.user_tag;
@@ -49,7 +49,7 @@ bool RKUserProcess::_addRegionsToArray(RKRegionWalkState& state, uint64_t start,
     while (cursor < end) {
         // A gap before the next image segment (or to the end of the mapping).
         if (!image || cursor < image->start) {
-            auto unused = piece(cursor, image ? std::min(image->start, end) : end, start, info);
+            auto unused = piece(state.regionBlocks, cursor, image ? std::min(image->start, end) : end, start, info);
             unused->name = kUnusedAreaName;
             unused->unusedSharedCacheRegion = true;
             // The gap belongs with the segment whose page it shares.
@@ -79,7 +79,7 @@ bool RKUserProcess::_addRegionsToArray(RKRegionWalkState& state, uint64_t start,
             image = std::move(following);
             continue;
         }
-        auto region = piece(pieceStart, pieceEnd, start, info);
+        auto region = piece(state.regionBlocks, pieceStart, pieceEnd, start, info);
         region->name = image->name();
         region->detailedName = image->segment == RKSegmentLinkedit ? kLinkeditDetail : image->ownerPath();
         region->segment = image->segment;

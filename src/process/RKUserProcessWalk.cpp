@@ -205,7 +205,12 @@ bool RKUserProcess::_addRegionForEntry(RKRegionWalkState& state, uint64_t start,
         printBailingOut(displayString());
         return true;
     }
-    auto region = std::make_shared<RKMemoryRegion>();
+    const bool ownedPseudoRegion = purgeState != VM_PURGABLE_VOLATILE && purgeState != VM_PURGABLE_EMPTY &&
+                                   info.user_tag == RK_OWNED_MEMORY_TAG;
+    // The list accounts for that memory object by object. Asked before the region is made: a
+    // region dropped stays in its block until the block goes (RKRegionBlocks.h).
+    if (ownedPseudoRegion && ownedVmObjects_) return false;
+    auto region = state.regionBlocks.make();
     region->start = start;
     region->size = size;
     region->user_tag = info.user_tag;
@@ -215,10 +220,7 @@ bool RKUserProcess::_addRegionForEntry(RKRegionWalkState& state, uint64_t start,
     region->wired = info.user_wired_count != 0;
     _setRegionSizes(*region, info, purgeState, state.breakDown);
 
-    bool ownedPseudoRegion = purgeState != VM_PURGABLE_VOLATILE && purgeState != VM_PURGABLE_EMPTY &&
-                             info.user_tag == RK_OWNED_MEMORY_TAG;
     if (ownedPseudoRegion) {
-        if (ownedVmObjects_) return false;  // the list accounts for that memory object by object
         state.unmappedOwnedRegion = region;
         if (info.object_id_full == 0) region->object_id = info.object_id;
     }
@@ -281,7 +283,7 @@ void RKUserProcess::_nameRegion(RKMemoryRegion& region, const RKRegionSubmapInfo
 
 void RKUserProcess::_addPageTableRegion(RKRegionWalkState& state) const {
     if (!state.breakDown || ledgers_ == 0) return;
-    auto region = std::make_shared<RKMemoryRegion>();
+    auto region = state.regionBlocks.make();
     region->size = ledgers_;
     region->dirtySize = ledgers_;
     region->start = RKRegionNoAddress;

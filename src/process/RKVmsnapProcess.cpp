@@ -238,7 +238,7 @@ void RKVmsnapProcess::_gatherSharedAnonymousPages(RKRegionWalkState& state) {
 
 void RKVmsnapProcess::_addUnconsumedOwnedObjectRegions(RKRegionWalkState& state) {
     for (const RKVmsnapUnaddressedRegion& saved : graph_.unaddressedRegions) {
-        auto region = std::make_shared<RKMemoryRegion>();
+        auto region = state.regionBlocks.make();
         region->start = RKRegionNoAddress;
         region->size = saved.size;
         region->user_tag = saved.user_tag;
