@@ -8,7 +8,7 @@
 // block (shared_ptr's aliasing constructor): the block lives while any of its regions is held.
 // A region that nobody holds any more is not destroyed then but with its block, so whoever
 // drops a region it made must not count on its destructor (which frees its subrange list): the
-// walk makes no region it may drop, or frees what such a region holds itself.
+// walk drops only regions that hold nothing, or frees their subranges itself.
 //
 // One walk, one thread: the maker is not shared between threads (the regions may be).
 #pragma once
