@@ -103,8 +103,8 @@ public:
 private:
     // Not owned: the object holds its regions, and as it goes clears this in each of them, so a
     // region whose object was released (after a report) answers null, which the analysis relies
-    // on. A plain pointer rather than a weak one: 8 bytes a region less, which brings a region
-    // and its shared_ptr block from glibc's 144-byte chunk to the 128-byte one.
+    // on. A plain pointer rather than a weak one: 8 bytes a region less (one per mapping; the
+    // walk makes them in blocks, RKRegionBlocks).
     RKMemoryObject* memoryObject_ = nullptr;
     std::unique_ptr<RKRangeList> subrangeList_;
 };
