@@ -36,7 +36,8 @@ std::optional<std::set<pid_t>> measuredPids(const fs::path& document) {
                                            "['processes'] if 'memspread' in p])",
                                            document.string()});
     std::istringstream words(parsed.standardOutput);
-    return parsed.exitedWith(0) ? std::optional(std::set<pid_t>(std::istream_iterator<pid_t>(words), {})) : std::nullopt;
+    if (!parsed.exitedWith(0)) return std::nullopt;
+    return std::set<pid_t>(std::istream_iterator<pid_t>(words), {});
 }
 
 // Idle children of the test, killed and reaped when it ends.

@@ -37,7 +37,8 @@ RKCommandResult memspread(std::vector<std::string> arguments) {
 
 // Every `from` in `text` replaced by `to`.
 std::string replaced(std::string text, const std::string& from, const std::string& to) {
-    for (size_t at = 0; (at = text.find(from, at)) != std::string::npos; at += to.size()) text.replace(at, from.size(), to);
+    for (size_t at = 0; (at = text.find(from, at)) != std::string::npos; at += to.size())
+        text.replace(at, from.size(), to);
     return text;
 }
 
