@@ -65,14 +65,15 @@ TEST(RKAllProcesses, EveryProcessMeasuredUnderADescriptorLimitOf64AndNoNameReach
     const fs::path directory = fs::temp_directory_path() / ("rk-names-" + std::to_string(getpid()));
     fs::create_directories(directory);
     fs::copy_file(MEMSPREAD_FIXTURE, directory / name);
-    RKFixtureProcess fixture;
-    ASSERT_TRUE(fixture.start((directory / name).string(), {directory.string()})) << fixture.error();
+    // The children first: forked later, they would hold the fixture's standard input open.
     RKIdleChildren children;
     for (pid_t pid = 0; children.pids.size() < 300 && (pid = fork()) >= 0;) {
         if (pid == 0) for (;;) pause();  // until killed
         children.pids.push_back(pid);
     }
     ASSERT_EQ(children.pids.size(), 300u);
+    RKFixtureProcess fixture;
+    ASSERT_TRUE(fixture.start((directory / name).string(), {directory.string()})) << fixture.error();
     const fs::path document = temporaryDocument("fd64");
     // Soft and hard limit alike, as `ulimit -n 64` sets them: memspread cannot raise it.
     RKCommandResult run = RKRunCommand({"prlimit", "--nofile=64:64", MEMSPREAD_BINARY, "-a", "-j", document.string()});
