@@ -36,7 +36,8 @@ std::optional<std::set<pid_t>> measuredPids(const fs::path& document) {
                                            "['processes'] if 'memspread' in p])",
                                            document.string()});
     std::istringstream words(parsed.standardOutput);
-    return parsed.exitedWith(0) ? std::optional(std::set<pid_t>(std::istream_iterator<pid_t>(words), {})) : std::nullopt;
+    if (!parsed.exitedWith(0)) return std::nullopt;
+    return std::set<pid_t>(std::istream_iterator<pid_t>(words), {});
 }
 
 // Idle children of the test, killed and reaped when it ends.
@@ -64,14 +65,15 @@ TEST(RKAllProcesses, EveryProcessMeasuredUnderADescriptorLimitOf64AndNoNameReach
     const fs::path directory = fs::temp_directory_path() / ("rk-names-" + std::to_string(getpid()));
     fs::create_directories(directory);
     fs::copy_file(MEMSPREAD_FIXTURE, directory / name);
-    RKFixtureProcess fixture;
-    ASSERT_TRUE(fixture.start((directory / name).string(), {directory.string()})) << fixture.error();
+    // The children first: forked later, they would hold the fixture's standard input open.
     RKIdleChildren children;
     for (pid_t pid = 0; children.pids.size() < 300 && (pid = fork()) >= 0;) {
         if (pid == 0) for (;;) pause();  // until killed
         children.pids.push_back(pid);
     }
     ASSERT_EQ(children.pids.size(), 300u);
+    RKFixtureProcess fixture;
+    ASSERT_TRUE(fixture.start((directory / name).string(), {directory.string()})) << fixture.error();
     const fs::path document = temporaryDocument("fd64");
     // Soft and hard limit alike, as `ulimit -n 64` sets them: memspread cannot raise it.
     RKCommandResult run = RKRunCommand({"prlimit", "--nofile=64:64", MEMSPREAD_BINARY, "-a", "-j", document.string()});

@@ -29,7 +29,8 @@ TEST(RKOwnedMemoryFixture, HeldMemoryIsChargedOnceToItsHolderAndUnmappedFindsIts
     RKFixtureProcess fixture;
     ASSERT_TRUE(fixture.start(MEMSPREAD_OWNED_FIXTURE)) << fixture.error();
     const pid_t holder = fixture.pid(), mapper = fixture.childPid();
-    RKCommandResult run = RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", std::to_string(holder), std::to_string(mapper)});
+    RKCommandResult run =
+        RKRunCommand({MEMSPREAD_BINARY, "-f", "bytes", std::to_string(holder), std::to_string(mapper)});
     ASSERT_TRUE(run.exitedWith(0)) << run.standardError;
     const std::string& report = run.standardOutput;
     // The holder costs what the kernel counts for its mappings plus what it holds unmapped (the
