@@ -28,11 +28,10 @@ public:
     void add(uint64_t key);
     // After the last add, before the first rank.
     void seal();
-    // The rank of a key that was added. One thread at a time: it keeps the last chunk it used.
-    uint32_t rank(uint64_t key) const { return rankFrom(key, rankCursor_); }
     size_t size() const { return count_; }
 
-    // Ranks for one of several threads that rank keys at once, with a last chunk of its own.
+    // The ranks of keys that were added, read through the chunk of the last key asked about;
+    // each thread that ranks keys has a reader of its own.
     class Reader {
     public:
         explicit Reader(const RKPageKeyRanks& ranks) : ranks_(ranks) {}
@@ -50,7 +49,6 @@ private:
 
     std::unordered_map<uint64_t, std::unique_ptr<Chunk>> chunks_;
     Cursor addCursor_;
-    mutable Cursor rankCursor_;
     std::vector<uint64_t> swapped_;
     uint32_t frames_ = 0;
     size_t count_ = 0;

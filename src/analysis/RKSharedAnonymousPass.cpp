@@ -106,9 +106,10 @@ private:
     void collectSets() {
         setOf_.assign(ranks_.size(), RKProcessSetTrie::kEmpty);
         firstHolder_.resize(ranks_.size());
+        RKPageKeyRanks::Reader ranks(ranks_);
         for (uint32_t p = 0; p < processes_.size(); p++) {
             for (const RKSharedAnonymousPage& page : processes_[p]->sharedAnonymousPages()) {
-                const uint32_t rank = ranks_.rank(page.page());
+                const uint32_t rank = ranks.rank(page.page());
                 if (setOf_[rank] == RKProcessSetTrie::kEmpty) firstHolder_[rank] = {p, page.range};
                 setOf_[rank] = sets_.with(setOf_[rank], p);
             }

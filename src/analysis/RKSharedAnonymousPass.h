@@ -11,7 +11,7 @@
 // exactly that set. The regions the pages came from lose them; that last walk runs one process
 // per worker thread, as each process writes only its own regions and member regions.
 //
-// Memory: the 12-byte page records the processes hold, and while the pass runs about 20 bytes a
+// Memory: the packed page records the processes hold (RKSharedPageList, about 4 bytes a page), and while the pass runs about 20 bytes a
 // distinct page; nothing per page after it. Time linear in page records.
 #pragma once
 

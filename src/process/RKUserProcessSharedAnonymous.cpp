@@ -53,7 +53,7 @@ void RKUserProcess::_gatherSharedAnonymousPages(RKRegionWalkState& state) {
 }
 
 void RKUserProcess::releaseSharedAnonymousPages() {
-    // Swapped with an empty vector: assigning {} would keep its capacity.
     sharedAnonymousPages_.release();
+    // Swapped with an empty vector: assigning {} would keep its capacity.
     RKRegionList().swap(sharedAnonymousRegions_);
 }

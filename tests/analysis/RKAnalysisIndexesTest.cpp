@@ -20,7 +20,8 @@ TEST(RKPageKeyRanks, RanksAreAscendingPlacesOfTheDistinctKeys) {
     std::sort(distinct.begin(), distinct.end());
     distinct.erase(std::unique(distinct.begin(), distinct.end()), distinct.end());
     ASSERT_EQ(ranks.size(), distinct.size());
-    for (size_t i = 0; i < distinct.size(); i++) EXPECT_EQ(ranks.rank(distinct[i]), i) << distinct[i];
+    RKPageKeyRanks::Reader reader(ranks);
+    for (size_t i = 0; i < distinct.size(); i++) EXPECT_EQ(reader.rank(distinct[i]), i) << distinct[i];
 }
 
 TEST(RKPointerSet, EachPointerIsNewOnceThroughGrowth) {
