@@ -89,6 +89,13 @@ TEST_F(RKMemoryObjectTest, MappersShareTheObjectUnlessOneSeesLessThanTheWhole) {
     EXPECT_EQ(totalsOf(*half->viewForProcess(*a)), (Totals{2 * kPage, 0, 2 * kPage, 0, 0}));
     EXPECT_EQ(totalsOf(*half->viewForProcess(*b)), (Totals{0, 0, 4 * kPage, 0, 0}));
     EXPECT_EQ(half->viewForProcess(*c), half);  // not a mapper: the whole object
+    // A copy shares the regions and the totals, never the views it was made from.
+    auto copied = half->copy();
+    ASSERT_EQ(copied->memoryRegions().size(), 2u);
+    EXPECT_EQ(copied->memoryRegions()[1], half->memoryRegions()[1]);
+    EXPECT_EQ(totalsOf(*copied), totalsOf(*half));
+    EXPECT_EQ(copied->processMemoryRegions(), nullptr);
+    EXPECT_EQ(copied->viewForProcess(*b), copied);
 
     // Kept for a mapper with two regions, or one that differs in wired bytes only; never for a
     // process alone, however it maps the object.
