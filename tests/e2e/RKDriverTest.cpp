@@ -7,7 +7,6 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <filesystem>
 #include <fstream>
 #include <regex>
@@ -145,10 +144,7 @@ TEST_F(RKDriverTest, NamesAndSelf) {
     EXPECT_EQ(resolve({tag_ + "twi"}), Keys{});
 
     // memspread is never its own target.
-    Keys all = resolve({"-a"});
-    EXPECT_EQ(all.count(getpid()), 0u);
-    EXPECT_TRUE(std::includes(all.begin(), all.end(), twins.begin(), twins.end()));
-    EXPECT_EQ(all.count(0), 1u);
+    EXPECT_EQ(resolve({"-a"}).count(getpid()), 0u);
 
     // A copy of the binary under a name of its own: nothing but itself answers to it.
     fs::path self = directory_ / (tag_ + "self");

@@ -79,7 +79,6 @@ TEST_F(RKKernelProcessTest, ZonesAndSitesBecomeRegionsAndCountersAuxData) {
     EXPECT_FALSE(kernel->auxData()->mergeWithData(nullptr));
 }
 
-// (A partial answer, without root, is one warning: RKKernelEndToEnd runs the binary as nobody.)
 TEST_F(RKKernelProcessTest, ARefusedAnswerIsAnError) {
     platform->kernelMemoryResult = KERN_FAILURE;
     auto kernel = gathered();
