@@ -79,6 +79,18 @@ TEST_F(RKKernelProcessTest, ZonesAndSitesBecomeRegionsAndCountersAuxData) {
     EXPECT_FALSE(kernel->auxData()->mergeWithData(nullptr));
 }
 
+// Without root the reader leaves out what only root may read, and the report says so once
+// rather than showing a kernel that holds no slab memory.
+TEST_F(RKKernelProcessTest, ARestrictedAnswerIsShownWithAWarning) {
+    platform->kernelMemory.restricted = true;
+    auto kernel = gathered();
+    ASSERT_TRUE(kernel && kernel->memoryRegions());
+    EXPECT_TRUE(kernel->errors().empty());
+    EXPECT_EQ(kernel->warnings(),
+              std::vector<std::string>{kernel->displayString() +
+                                       ": slab caches and vmalloc callers need root; only /proc/meminfo's figures are shown"});
+}
+
 TEST_F(RKKernelProcessTest, ARefusedAnswerIsAnError) {
     platform->kernelMemoryResult = KERN_FAILURE;
     auto kernel = gathered();
