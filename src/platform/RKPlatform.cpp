@@ -13,17 +13,25 @@ std::mutex& currentMutex() {
     return mutex;
 }
 
+// Owns the platform; changed only under the mutex.
 std::shared_ptr<RKPlatform>& currentSlot() {
     static std::shared_ptr<RKPlatform> platform;
     return platform;
 }
 
+// What current() answers without the lock: every region of every walk asks, from every worker.
+std::atomic<RKPlatform*> gCurrent{nullptr};
+
 }  // namespace
 
 RKPlatform& RKPlatform::current() {
+    if (RKPlatform* platform = gCurrent.load(std::memory_order_acquire)) return *platform;
     std::lock_guard<std::mutex> lock(currentMutex());
     auto& slot = currentSlot();
-    if (!slot) slot = std::make_shared<RKLinuxPlatform>();
+    if (!slot) {
+        slot = std::make_shared<RKLinuxPlatform>();
+        gCurrent.store(slot.get(), std::memory_order_release);
+    }
     return *slot;
 }
 
@@ -31,6 +39,7 @@ std::shared_ptr<RKPlatform> RKPlatform::setCurrent(std::shared_ptr<RKPlatform> p
     std::lock_guard<std::mutex> lock(currentMutex());
     auto previous = std::move(currentSlot());
     currentSlot() = std::move(platform);
+    gCurrent.store(currentSlot().get(), std::memory_order_release);
     return previous;
 }
 
