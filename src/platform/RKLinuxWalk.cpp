@@ -18,7 +18,14 @@
 
 namespace {
 
-thread_local RKReadBuffer tSpareText;
+// What the worker's last walk used, kept for its next one: the text buffer and the region and
+// VMA arrays of an ordinary process, so that their pages are not faulted in again for each process.
+thread_local std::unique_ptr<RKLinuxWalkSnapshot> tSpareSnapshot;
+thread_local std::vector<RKSmapsVma> tSpareVmas;
+
+// Larger ones are freed, not held for the rest of the run.
+constexpr size_t kLargestSpareText = 4 << 20;
+constexpr size_t kLargestSpareVmas = 8192;
 
 // Mount tables by (proc root, mount namespace): processes of one namespace share one read of
 // mountinfo. A device missing from a table makes the walk read the target's file again.
@@ -118,19 +125,32 @@ std::optional<RKFileIdentity> mappedFileIdentity(int dirfd, const RKSmapsVma& vm
     return RKFileIdentity{RKDeviceKey(major(st.st_dev), minor(st.st_dev)), static_cast<uint64_t>(st.st_ino)};
 }
 
+bool sameFile(const RKSmapsVma& a, const RKSmapsVma& b) {
+    return a.inode == b.inode && a.devMajor == b.devMajor && a.devMinor == b.devMinor && a.path == b.path;
+}
+
 void classifyAll(RKLinuxTask& task, const std::vector<RKSmapsVma>& vmas, const RKVmaContext& context,
                  RKLinuxWalkSnapshot& snapshot) {
     bool mapFilesAllowed = true;
+    // A file is mapped in several adjacent VMAs (its text, data, read-only parts): its identity
+    // is read for the first of them.
+    const RKSmapsVma* lastFile = nullptr;
+    std::optional<RKFileIdentity> lastIdentity;
     snapshot.regions.reserve(vmas.size());
     for (const auto& vma : vmas) {
-        RKLinuxRegion region;
+        RKLinuxRegion& region = snapshot.regions.emplace_back();
         region.vma = vma;
         region.kind = RKClassifyVma(vma, context);
         std::optional<RKFileIdentity> identity;
-        if (region.kind == RKVmaKind::File) identity = mappedFileIdentity(task.directoryFd(), vma, mapFilesAllowed);
+        if (region.kind == RKVmaKind::File) {
+            if (!lastFile || !sameFile(*lastFile, vma)) {
+                lastIdentity = mappedFileIdentity(task.directoryFd(), vma, mapFilesAllowed);
+                lastFile = &vma;
+            }
+            identity = lastIdentity;
+        }
         region.info = RKRegionInfoForVma(vma, region.kind, context, identity);
         region.detail = RKDetailForVma(vma, region.kind);
-        snapshot.regions.push_back(region);
     }
 }
 
@@ -161,8 +181,8 @@ std::shared_ptr<const RKMountTable> RKMountTableForTask(RKLinuxTask& task, const
 
 kern_return_t RKLoadWalkSnapshot(RKLinuxTask& task, const std::string& procRoot, uint64_t pageSize,
                                  std::unique_ptr<RKLinuxWalkSnapshot>& snapshot) {
-    auto fresh = std::make_unique<RKLinuxWalkSnapshot>();
-    fresh->text.swap(tSpareText);
+    std::unique_ptr<RKLinuxWalkSnapshot> fresh = std::move(tSpareSnapshot);
+    if (!fresh) fresh = std::make_unique<RKLinuxWalkSnapshot>();
     int error = fresh->text.readAt(task.directoryFd(), "smaps");
     if (error != 0) {
         RKRecycleWalkSnapshot(std::move(fresh));
@@ -172,7 +192,8 @@ kern_return_t RKLoadWalkSnapshot(RKLinuxTask& task, const std::string& procRoot,
         RKRecycleWalkSnapshot(std::move(fresh));
         return MACH_SEND_INVALID_DEST;
     }
-    std::vector<RKSmapsVma> vmas;
+    std::vector<RKSmapsVma> vmas = std::move(tSpareVmas);
+    vmas.clear();
     RKParseSmaps(fresh->text.view(), vmas);
 
     RKVmaContext context;
@@ -189,15 +210,18 @@ kern_return_t RKLoadWalkSnapshot(RKLinuxTask& task, const std::string& procRoot,
     if (anySysV(vmas)) context.ipcNamespace = namespaceInode(task.directoryFd(), "ns/ipc");
 
     classifyAll(task, vmas, context, *fresh);
+    if (vmas.capacity() <= kLargestSpareVmas) tSpareVmas = std::move(vmas);
     fresh->end = processGone(task.directoryFd()) ? MACH_SEND_INVALID_DEST : KERN_INVALID_ADDRESS;
     snapshot = std::move(fresh);
     return KERN_SUCCESS;
 }
 
 void RKRecycleWalkSnapshot(std::unique_ptr<RKLinuxWalkSnapshot> snapshot) {
-    // The text of an ordinary process is kept for the worker's next one; a huge one is freed,
-    // not held for the rest of the run.
-    constexpr size_t kLargestSpare = 4 << 20;
-    if (snapshot && snapshot->text.capacity() > tSpareText.capacity() && snapshot->text.capacity() <= kLargestSpare)
-        tSpareText.swap(snapshot->text);
+    if (!snapshot || snapshot->text.capacity() > kLargestSpareText || snapshot->regions.capacity() > kLargestSpareVmas)
+        return;
+    if (tSpareSnapshot && tSpareSnapshot->text.capacity() >= snapshot->text.capacity()) return;
+    snapshot->regions.clear();
+    snapshot->end = KERN_INVALID_ADDRESS;
+    snapshot->readyForWalk = false;
+    tSpareSnapshot = std::move(snapshot);
 }
