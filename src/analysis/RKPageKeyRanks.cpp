@@ -35,6 +35,19 @@ void RKPageKeyRanks::add(uint64_t key) {
     chunk(key).bits[offset / 64] |= uint64_t{1} << (offset % 64);
 }
 
+void RKPageKeyRanks::addAll(RKPageKeyRanks&& other) {
+    for (auto& [index, theirs] : other.chunks_) {
+        std::unique_ptr<Chunk>& slot = chunks_[index];
+        if (!slot) {
+            slot = std::move(theirs);
+            continue;
+        }
+        for (size_t w = 0; w < kWords; w++) slot->bits[w] |= theirs->bits[w];
+    }
+    swapped_.insert(swapped_.end(), other.swapped_.begin(), other.swapped_.end());
+    other = RKPageKeyRanks();
+}
+
 void RKPageKeyRanks::seal() {
     std::vector<uint64_t> order;
     order.reserve(chunks_.size());

@@ -26,6 +26,9 @@ class RKPageKeyRanks {
 
 public:
     void add(uint64_t key);
+    // Adds every key `other` was given, leaving it empty: instances filled side by side, one a
+    // thread, become one. Moves the chunks this one lacks, ORs the words of those both have.
+    void addAll(RKPageKeyRanks&& other);
     // After the last add, before the first rank.
     void seal();
     size_t size() const { return count_; }

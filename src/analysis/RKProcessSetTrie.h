@@ -31,6 +31,44 @@ public:
         return result;
     }
 
+    // Unions of this trie's sets with sets of `later`, a trie of processes that all come after
+    // this one's (a later slice of the processes, met on another thread), as sets of this trie.
+    // Every (set, prefix of a later set) joined is remembered, so each node this trie gains is
+    // made once, as if the later processes had been met here.
+    class Joiner {
+    public:
+        Joiner(RKProcessSetTrie& into, const RKProcessSetTrie& later) : into_(into), later_(later) {}
+        uint32_t join(uint32_t set, uint32_t laterSet) {
+            if (laterSet == kEmpty) return set;
+            const uint64_t key = uint64_t{set} << 32 | laterSet;
+            if (key == lastKey_) return lastTo_;  // neighbouring pages mostly share their holders
+            // Up the later set's prefixes to one joined before, or to none; then down, adding.
+            uint32_t to = set;
+            for (uint32_t prefix = laterSet; prefix != kEmpty; prefix = later_.nodes_[prefix].parent) {
+                auto found = made_.find(uint64_t{set} << 32 | prefix);
+                if (found != made_.end()) {
+                    to = found->second;
+                    break;
+                }
+                path_.push_back(prefix);
+            }
+            for (; !path_.empty(); path_.pop_back()) {
+                to = into_.with(to, later_.nodes_[path_.back()].last);
+                made_.emplace(uint64_t{set} << 32 | path_.back(), to);
+            }
+            lastKey_ = key, lastTo_ = to;
+            return to;
+        }
+
+    private:
+        RKProcessSetTrie& into_;
+        const RKProcessSetTrie& later_;
+        std::unordered_map<uint64_t, uint32_t> made_;
+        std::vector<uint32_t> path_;
+        uint64_t lastKey_ = UINT64_MAX;
+        uint32_t lastTo_ = kEmpty;
+    };
+
 private:
     struct Node {
         uint32_t parent;

@@ -3,6 +3,7 @@
 #include <cstdio>
 
 #include <algorithm>
+#include <atomic>
 #include <cstdint>
 #include <string>
 #include <unordered_map>
@@ -80,58 +81,116 @@ public:
     }
 
     RKSharedAnonymousSummary run() {
-        if (processes_.size() >= 2) {
-            rankPages();
-            collectSets();
-            makeObjects();
-            attributePages();
-            attach();
+        if (processes_.size() < 2) {
+            for (RKUserProcess* process : processes_) process->releaseSharedAnonymousPages();
+            return summary_;
         }
-        for (RKUserProcess* process : processes_) process->releaseSharedAnonymousPages();
+        planSlices();
+        rankPages();
+        collectSets();
+        makeObjects();
+        attributePages();  // releases each process's pages once read
+        attach();
         return summary_;
     }
 
 private:
     static constexpr uint32_t kNoObject = UINT32_MAX;
+    // Each slice beyond the first costs 4 bytes a distinct page while the pass runs.
+    static constexpr size_t kMostSlices = 4;
+    // Apart by cache lines: each thread's trie keeps its last lookup.
+    struct alignas(64) Slice {
+        uint32_t begin = 0, end = 0;  // process numbers
+        RKPageKeyRanks ranks;         // until joined
+        RKProcessSetTrie sets;
+        std::vector<uint32_t> setOf;  // by page rank
+    };
+    // A page's first holder: process number, then range.
+    static constexpr uint64_t kNoHolder = UINT64_MAX;
+
+    // Contiguous slices of the processes, of about equal page counts: the ranks and the sets
+    // are found slice by slice, a thread each, then joined.
+    void planSlices() {
+        const size_t count = std::min(RKOnlineCpuCount(), kMostSlices);
+        uint64_t pages = 0;
+        for (RKUserProcess* process : processes_) pages += process->sharedAnonymousPages().size();
+        std::vector<uint32_t> begins;
+        uint64_t before = 0;
+        for (uint32_t p = 0; p < processes_.size(); p++) {
+            if (begins.size() < count && before >= pages * begins.size() / count) begins.push_back(p);
+            before += processes_[p]->sharedAnonymousPages().size();
+        }
+        slices_ = std::vector<Slice>(begins.size());
+        for (size_t s = 0; s < begins.size(); s++) {
+            slices_[s].begin = begins[s];
+            slices_[s].end = s + 1 < begins.size() ? begins[s + 1] : static_cast<uint32_t>(processes_.size());
+        }
+    }
 
     void rankPages() {
-        for (RKUserProcess* process : processes_)
-            for (const RKSharedAnonymousPage& page : process->sharedAnonymousPages()) ranks_.add(page.page());
+        RKParallelApplyOnEveryCpu(slices_.size(), [this](size_t s) {
+            Slice& slice = slices_[s];
+            for (uint32_t p = slice.begin; p < slice.end; p++)
+                for (const RKSharedAnonymousPage& page : processes_[p]->sharedAnonymousPages()) slice.ranks.add(page.page());
+        });
+        for (Slice& slice : slices_) ranks_.addAll(std::move(slice.ranks));
         ranks_.seal();
     }
 
-    // Every page's set of measured holders, and where the first of them holds it. Each process's
-    // pages are read in order, one process after another: the arrays by rank are walked ascending
-    // once a process, never one page across every process.
+    // Every page's set of measured holders in each slice, and where the first of them holds it.
+    // Each process's pages are read in order, one process after another: the arrays by rank are
+    // walked ascending once a process, never one page across every process.
     void collectSets() {
-        setOf_.assign(ranks_.size(), RKProcessSetTrie::kEmpty);
-        firstHolder_.resize(ranks_.size());
+        firstHolder_.assign(ranks_.size(), kNoHolder);
+        RKParallelApplyOnEveryCpu(slices_.size(), [this](size_t s) { collectSetsOf(slices_[s]); });
+    }
+
+    void collectSetsOf(Slice& slice) {
+        slice.setOf.assign(ranks_.size(), RKProcessSetTrie::kEmpty);
         RKPageKeyRanks::Reader ranks(ranks_);
-        for (uint32_t p = 0; p < processes_.size(); p++) {
+        for (uint32_t p = slice.begin; p < slice.end; p++) {
             for (const RKSharedAnonymousPage& page : processes_[p]->sharedAnonymousPages()) {
                 const uint32_t rank = ranks.rank(page.page());
-                if (setOf_[rank] == RKProcessSetTrie::kEmpty) firstHolder_[rank] = {p, page.range};
-                setOf_[rank] = sets_.with(setOf_[rank], p);
+                uint32_t& set = slice.setOf[rank];
+                if (set == RKProcessSetTrie::kEmpty) holds(rank, uint64_t{p} << 32 | page.range);
+                set = slice.sets.with(set, p);
             }
+        }
+    }
+
+    // The first holder is the least process number: a slice's first find of a page stays unless
+    // an earlier slice finds it too, whichever thread gets there first.
+    void holds(uint32_t rank, uint64_t holder) {
+        std::atomic_ref<uint64_t> first(firstHolder_[rank]);
+        uint64_t seen = first.load(std::memory_order_relaxed);
+        while (holder < seen && !first.compare_exchange_weak(seen, holder, std::memory_order_relaxed)) {
         }
     }
 
     // In ascending page order: each page that two measured processes or more hold gets its
     // object (by set and name) and its index there. One measured process alone: its private memory.
+    // The slices' sets join into sets of the first slice's trie.
     void makeObjects() {
         objectOf_.assign(ranks_.size(), kNoObject);
         indexOf_.resize(ranks_.size());
+        RKProcessSetTrie& sets = slices_.front().sets;
+        std::vector<RKProcessSetTrie::Joiner> joiners;
+        for (size_t s = 1; s < slices_.size(); s++) joiners.emplace_back(sets, slices_[s].sets);
         for (size_t rank = 0; rank < ranks_.size(); rank++) {
-            if (sets_.size(setOf_[rank]) < 2) continue;
+            uint32_t set = slices_.front().setOf[rank];
+            for (size_t s = 1; s < slices_.size(); s++) set = joiners[s - 1].join(set, slices_[s].setOf[rank]);
+            if (sets.size(set) < 2) continue;
             summary_.sharedPages++;
             // Named after the region the first member holds it in, so every member counts it alike.
-            const auto [p, range] = firstHolder_[rank];
-            const RKMemoryRegion& namedAfter = *processes_[p]->sharedAnonymousRegions()[range];
-            objectOf_[rank] = objectFor(setOf_[rank], namedAfter);
+            const uint64_t holder = firstHolder_[rank];
+            const RKMemoryRegion& namedAfter =
+                *processes_[holder >> 32]->sharedAnonymousRegions()[static_cast<uint32_t>(holder)];
+            objectOf_[rank] = objectFor(sets, set, namedAfter);
             indexOf_[rank] = objects_[objectOf_[rank]].nextIndex++;
         }
-        std::vector<uint32_t>().swap(setOf_);
-        std::vector<Holder>().swap(firstHolder_);
+        joiners.clear();
+        std::vector<Slice>().swap(slices_);
+        std::vector<uint64_t>().swap(firstHolder_);
     }
 
     // Each holder's page moves from the region it was found in to its member region of the
@@ -164,16 +223,17 @@ private:
             }
             region->add(indexOf_[rank], page.swapped(), pageSize);
         }
+        process.releaseSharedAnonymousPages();  // read for the last time
     }
 
-    uint32_t objectFor(uint32_t set, const RKMemoryRegion& namedAfter) {
+    uint32_t objectFor(const RKProcessSetTrie& sets, uint32_t set, const RKMemoryRegion& namedAfter) {
         auto [name, added] = names_.try_emplace(namedAfter.name + '\0' + namedAfter.detailedName,
                                                 static_cast<uint32_t>(names_.size()));
         const uint64_t key = static_cast<uint64_t>(set) << 32 | name->second;
         auto [slot, made] = objectIndex_.try_emplace(key, static_cast<uint32_t>(objects_.size()));
         if (made) {
             SharedObject object;
-            object.members = sets_.members(set);
+            object.members = sets.members(set);
             const uint64_t objectId = RKSharedAnonymousObjectIdBase | (objects_.size() + 1);
             for (size_t m = 0; m < object.members.size(); m++) object.regions.emplace_back(namedAfter, objectId);
             objects_.push_back(std::move(object));
@@ -181,36 +241,31 @@ private:
         return slot->second;
     }
 
-    // Each member's region of each object joins that member's regions.
+    // Each member's region of each object joins that member's regions, in object order; the
+    // processes run side by side, as each finishes and copies only its own.
     void attach() {
-        std::vector<RKRegionList> added(processes_.size());
+        std::vector<std::vector<MemberRegion*>> added(processes_.size());
         for (SharedObject& object : objects_)
-            for (size_t m = 0; m < object.members.size(); m++)
-                added[object.members[m]].push_back(object.regions[m].finish(processes_[object.members[m]]->pageSize()));
-        for (size_t p = 0; p < processes_.size(); p++) {
-            if (added[p].empty()) continue;
+            for (size_t m = 0; m < object.members.size(); m++) added[object.members[m]].push_back(&object.regions[m]);
+        RKParallelApplyOnEveryCpu(processes_.size(), [&](size_t p) {
+            if (added[p].empty()) return;
+            RKUserProcess& process = *processes_[p];
             // Sized exactly: a list grown by insertion would keep up to twice its regions' room.
             static const RKRegionList kNone;
-            const RKRegionList& had = processes_[p]->memoryRegions() ? *processes_[p]->memoryRegions() : kNone;
+            const RKRegionList& had = process.memoryRegions() ? *process.memoryRegions() : kNone;
             RKRegionList regions;
             regions.reserve(had.size() + added[p].size());
             regions.insert(regions.end(), had.begin(), had.end());
-            regions.insert(regions.end(), added[p].begin(), added[p].end());
-            processes_[p]->setMemoryRegions(std::move(regions));
-        }
+            for (MemberRegion* region : added[p]) regions.push_back(region->finish(process.pageSize()));
+            process.setMemoryRegions(std::move(regions));
+        });
     }
 
-    struct Holder {
-        uint32_t process;
-        uint32_t range;
-    };
-
     std::vector<RKUserProcess*> processes_;
+    std::vector<Slice> slices_;
     RKPageKeyRanks ranks_;
-    RKProcessSetTrie sets_;
     // By page rank.
-    std::vector<uint32_t> setOf_;
-    std::vector<Holder> firstHolder_;
+    std::vector<uint64_t> firstHolder_;
     std::vector<uint32_t> objectOf_;
     std::vector<uint64_t> indexOf_;
     std::unordered_map<std::string, uint32_t> names_;

@@ -4,7 +4,8 @@
 // private anonymous regions that other mappings hold too, by frame (or swap entry), sorted.
 // Every distinct page gets its rank, and one walk of each process's list in turn finds, for
 // each page, the set of measured processes that map it; a page only one of them maps stays that
-// process's private memory. Each sharing set (and category name) becomes
+// process's private memory. Both walks run on contiguous slices of the processes, a thread each,
+// whose sets then join in rank order. Each sharing set (and category name) becomes
 // one memory object whose identity is the set: every member gets a region without an address
 // whose subranges lie at the page's index in the set's ascending frame list (the same index in
 // every member), so the range list counts the page once and the sharing groups put it with
@@ -12,7 +13,8 @@
 // per worker thread, as each process writes only its own regions and member regions.
 //
 // Memory: the packed page records the processes hold (RKSharedPageList, about 4 bytes a page), and while the pass runs about 20 bytes a
-// distinct page; nothing per page after it. Time linear in page records.
+// distinct page, 4 more for each slice beyond the first; nothing per page after it. Time linear
+// in page records.
 #pragma once
 
 #include <memory>
