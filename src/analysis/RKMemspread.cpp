@@ -5,7 +5,7 @@
 #include <algorithm>
 
 #include "analysis/RKCancelSource.h"
-#include "analysis/RKWorkerPool.h"
+#include "platform/RKWorkerPool.h"
 #include "process/RKGatherScope.h"
 #include "process/RKUserProcess.h"
 

@@ -4,11 +4,11 @@
 
 #include "analysis/RKMemspread.h"
 #include "analysis/RKPointerSet.h"
-#include "analysis/RKWorkerPool.h"
 #include "model/RKMemoryCategory.h"
 #include "model/RKMemoryObject.h"
 #include "model/RKMemoryRegion.h"
 #include "platform/RKLinuxVmaClassifier.h"
+#include "platform/RKWorkerPool.h"
 
 namespace {
 

@@ -7,11 +7,11 @@
 #include <vector>
 
 #include "analysis/RKSystemMemory.h"
-#include "analysis/RKWorkerPool.h"
 #include "model/RKAuxData.h"
 #include "model/RKMemoryCategory.h"
 #include "model/RKMemoryObject.h"
 #include "model/RKProcessGroup.h"
+#include "platform/RKWorkerPool.h"
 #include "process/RKUnreadProcess.h"
 
 namespace {

@@ -12,10 +12,10 @@
 #include "analysis/RKMemspread.h"
 #include "analysis/RKPageKeyRanks.h"
 #include "analysis/RKProcessSetTrie.h"
-#include "analysis/RKWorkerPool.h"
 #include "model/RKMemoryRegion.h"
 #include "model/RKMemoryTotal.h"
 #include "platform/RKFreedHeap.h"
+#include "platform/RKWorkerPool.h"
 #include "process/RKAnalysisSettings.h"
 #include "process/RKUserProcess.h"
 

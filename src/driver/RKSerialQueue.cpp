@@ -2,7 +2,7 @@
 
 #include <pthread.h>
 
-#include "analysis/RKWorkerPool.h"
+#include "platform/RKWorkerPool.h"
 
 RKSerialQueue::RKSerialQueue(const char* label, int niceIncrement)
     : thread_([this, label, niceIncrement] { run(label, niceIncrement); }) {}

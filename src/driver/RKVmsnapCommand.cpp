@@ -17,8 +17,8 @@
 #include <string>
 #include <vector>
 
-#include "analysis/RKWorkerPool.h"
 #include "platform/RKPlatform.h"
+#include "platform/RKWorkerPool.h"
 #include "process/RKAnalysisSettings.h"
 #include "process/RKGatherScope.h"
 #include "process/RKProcess.h"

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -11,6 +12,7 @@
 #include "platform/RKLinuxPageReader.h"
 #include "platform/RKLinuxVmaClassifier.h"
 #include "platform/RKPlatform.h"
+#include "platform/RKProcStatusFigures.h"
 #include "platform/RKReadBuffer.h"
 #include "platform/RKSmapsParser.h"
 #include "platform/RKUniqueFd.h"
@@ -53,6 +55,9 @@ public:
     // with such pages, as the latest walk saw them; kept after the walk, for the bound of what
     // cannot be attributed where frames are hidden.
     std::vector<std::pair<uint64_t, uint64_t>> sharedAnonymousBytes;
+    // The figures of status, from the first read that succeeded through this task
+    // (RKLinuxFigures.cpp).
+    std::optional<RKStatusFigures> statusFigures;
 
 private:
     pid_t pid_;

@@ -1,9 +1,10 @@
 #include "platform/RKPlatform.h"
 
 #include <atomic>
-#include <cstdio>
 #include <mutex>
+#include <string>
 
+#include "platform/RKErrorCapture.h"
 #include "platform/RKLinuxPlatform.h"
 
 namespace {
@@ -58,5 +59,5 @@ const char* mach_error_string(kern_return_t code) {
 }
 
 void mach_error(const char* label, kern_return_t code) {
-    std::fprintf(stderr, "%s: %s\n", label, mach_error_string(code));
+    RKWriteError(std::string(label) + ": " + mach_error_string(code) + "\n");
 }

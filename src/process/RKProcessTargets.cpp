@@ -2,11 +2,14 @@
 // itself, name and pid lookup, descendants, and the idle-exit filter.
 #include <algorithm>
 #include <cstdlib>
+#include <string>
 #include <unordered_map>
 #include <unordered_set>
 #include <vector>
 
+#include "platform/RKErrorCapture.h"
 #include "platform/RKPlatform.h"
+#include "platform/RKWorkerPool.h"
 #include "process/RKProcess.h"
 #include "process/RKUnreadProcess.h"
 
@@ -75,17 +78,36 @@ std::optional<std::vector<RKBsdInfo>> RKCopyAllBsdInfo() {
     return records;
 }
 
+// Each process is listed and opened on its own, so the processes are read side by side; what each
+// writes to standard error is kept and written in list order, as one pass in order would.
 std::optional<RKTargetMap> RKProcess::allProcessesExcludingPids(const std::set<pid_t>& excluded) {
-    auto list = RKCopyAllBsdInfo();
-    if (!list) return std::nullopt;
-    RKTargetMap result;
-    for (const RKBsdInfo& info : *list) {
-        if (excluded.count(info.pbi_pid)) continue;
+    RKPlatform& platform = RKPlatform::current();
+    auto pids = platform.listAllPids();
+    if (!pids) return std::nullopt;
+    struct Listed {
+        bool listed = false;  // gone or hidden: dropped
+        pid_t pid = 0;
+        std::shared_ptr<RKProcess> process;
+        std::string messages;
+    };
+    std::vector<Listed> items(pids->size());
+    RKParallelApplyOnEveryCpu(pids->size(), [&](size_t i) {
+        auto info = platform.bsdInfo((*pids)[i]);
+        if (!info) return;
+        items[i].listed = true;
+        items[i].pid = info->pbi_pid;
+        if (excluded.count(info->pbi_pid)) return;
+        RKErrorCapture capture;
         kern_return_t taskResult = KERN_FAILURE;
-        if (auto process = processWithBsdInfo(info, &taskResult))
-            result[info.pbi_pid] = std::move(process);
-        else if (auto unread = RKUnreadProcess::processForFailure(info, taskResult))
-            result[info.pbi_pid] = std::move(unread);
+        items[i].process = processWithBsdInfo(*info, &taskResult);
+        if (!items[i].process) items[i].process = RKUnreadProcess::processForFailure(*info, taskResult);
+        items[i].messages = capture.take();
+    });
+    if (std::none_of(items.begin(), items.end(), [](const Listed& item) { return item.listed; })) return std::nullopt;
+    RKTargetMap result;
+    for (Listed& item : items) {
+        if (!item.messages.empty()) RKWriteError(item.messages);
+        if (item.process) result[item.pid] = std::move(item.process);
     }
     return result;
 }

@@ -1,11 +1,11 @@
 #include "process/RKUserProcess.h"
 
 #include <cerrno>
-#include <cstdio>
 #include <cstring>
 
 #include "model/RKAssert.h"
 #include "model/RKAuxData.h"
+#include "platform/RKErrorCapture.h"
 
 namespace {
 
@@ -20,8 +20,7 @@ RKLedgerTemplate readLedgerTemplate() {
     std::vector<std::string> names;
     int error = RKPlatform::current().ledgerTemplate(names);
     if (error != 0) {
-        errno = error;
-        std::perror("Unable to retrieve ledger template info");
+        RKWriteError(std::string("Unable to retrieve ledger template info: ") + std::strerror(error) + "\n");
         return result;
     }
     result.count = static_cast<int64_t>(names.size());
@@ -83,7 +82,7 @@ bool RKUserProcess::_setSharedRegionFromPlatform(int32_t platform) {
         return true;
     }
     if (platform == RKPlatformUnknown) {
-        std::fprintf(stderr, "Unable to determine platform architecture of target\n");
+        RKWriteError("Unable to determine platform architecture of target\n");
         return false;
     }
     return true;

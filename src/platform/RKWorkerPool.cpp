@@ -1,4 +1,4 @@
-#include "analysis/RKWorkerPool.h"
+#include "platform/RKWorkerPool.h"
 
 #include <sys/resource.h>
 #include <sys/syscall.h>
