@@ -66,48 +66,44 @@ bool resolveDescription(const std::string& description, const std::vector<RKBsdI
 
 }  // namespace
 
+// Each record is read on its own, side by side; the list keeps the kernel's order.
 std::optional<std::vector<RKBsdInfo>> RKCopyAllBsdInfo() {
     RKPlatform& platform = RKPlatform::current();
     auto pids = platform.listAllPids();
     if (!pids) return std::nullopt;
+    std::vector<std::optional<RKBsdInfo>> read(pids->size());
+    RKParallelApplyOnEveryCpu(pids->size(), [&](size_t i) { read[i] = platform.bsdInfo((*pids)[i]); });
     std::vector<RKBsdInfo> records;
-    records.reserve(pids->size());
-    for (pid_t pid : *pids)
-        if (auto info = platform.bsdInfo(pid)) records.push_back(*info);  // gone or hidden: dropped
+    records.reserve(read.size());
+    for (const auto& info : read)
+        if (info) records.push_back(*info);  // gone or hidden: dropped
     if (records.empty()) return std::nullopt;
     return records;
 }
 
-// Each process is listed and opened on its own, so the processes are read side by side; what each
-// writes to standard error is kept and written in list order, as one pass in order would.
+// Each process is opened on its own, so the processes are read side by side; what each writes to
+// standard error is kept and written in list order, as one pass in order would.
 std::optional<RKTargetMap> RKProcess::allProcessesExcludingPids(const std::set<pid_t>& excluded) {
-    RKPlatform& platform = RKPlatform::current();
-    auto pids = platform.listAllPids();
-    if (!pids) return std::nullopt;
-    struct Listed {
-        bool listed = false;  // gone or hidden: dropped
-        pid_t pid = 0;
+    auto list = RKCopyAllBsdInfo();
+    if (!list) return std::nullopt;
+    struct Opened {
         std::shared_ptr<RKProcess> process;
         std::string messages;
     };
-    std::vector<Listed> items(pids->size());
-    RKParallelApplyOnEveryCpu(pids->size(), [&](size_t i) {
-        auto info = platform.bsdInfo((*pids)[i]);
-        if (!info) return;
-        items[i].listed = true;
-        items[i].pid = info->pbi_pid;
-        if (excluded.count(info->pbi_pid)) return;
+    std::vector<Opened> opened(list->size());
+    RKParallelApplyOnEveryCpu(list->size(), [&](size_t i) {
+        const RKBsdInfo& info = (*list)[i];
+        if (excluded.count(info.pbi_pid)) return;
         RKErrorCapture capture;
         kern_return_t taskResult = KERN_FAILURE;
-        items[i].process = processWithBsdInfo(*info, &taskResult);
-        if (!items[i].process) items[i].process = RKUnreadProcess::processForFailure(*info, taskResult);
-        items[i].messages = capture.take();
+        opened[i].process = processWithBsdInfo(info, &taskResult);
+        if (!opened[i].process) opened[i].process = RKUnreadProcess::processForFailure(info, taskResult);
+        opened[i].messages = capture.take();
     });
-    if (std::none_of(items.begin(), items.end(), [](const Listed& item) { return item.listed; })) return std::nullopt;
     RKTargetMap result;
-    for (Listed& item : items) {
-        if (!item.messages.empty()) RKWriteError(item.messages);
-        if (item.process) result[item.pid] = std::move(item.process);
+    for (size_t i = 0; i < opened.size(); i++) {
+        if (!opened[i].messages.empty()) RKWriteError(opened[i].messages);
+        if (opened[i].process) result[(*list)[i].pbi_pid] = std::move(opened[i].process);
     }
     return result;
 }
