@@ -7,6 +7,7 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <chrono>
 #include <thread>
 
 #include "analysis/RKCancelSource.h"
@@ -17,13 +18,17 @@ namespace {
 
 int ownNiceness() { return ::getpriority(PRIO_PROCESS, static_cast<id_t>(::gettid())); }
 
-// A process whose gathering only records how often, how niced and between which stamps it ran.
+// A process whose gathering only records how often, how niced and between which stamps it ran;
+// given a flag, it first waits (boundedly) for it, so a test can order it after another process.
 struct RKRecordingProcess : RKProcess {
     int gathered = 0;
     int niceness = 0;
     size_t stampsBefore = 0;
     size_t gathersOpen = 0;
+    const std::atomic<bool>* waitFor = nullptr;
     void gatherData() override {
+        for (int waited = 0; waitFor && !waitFor->load() && waited < 10000; waited++)
+            std::this_thread::sleep_for(std::chrono::milliseconds(1));
         gathered++;
         niceness = ownNiceness();
         auto& platform = dynamic_cast<RKScriptedPlatform&>(RKPlatform::current());
@@ -63,15 +68,20 @@ TEST(RKGather, ACancelBeforeGatheringGathersNothingAndFlagsTheLowestPid) {
 }
 
 // A cancel during gathering lets the processes already started finish and skips the rest.
+// The others wait for the cancel, so another worker cannot run them all before it comes.
 TEST(RKGather, ACancelDuringGatheringSkipsTheProcessesNotYetStarted) {
     std::vector<pid_t> pids;
     for (pid_t pid = 1; pid <= 200; pid++) pids.push_back(pid);
     Gathering g(pids);
+    std::atomic<bool> cancelled{false};
+    for (const auto& process : g.processes) process->waitFor = &cancelled;
     struct Canceller : RKRecordingProcess {
         RKMemspread* memspread = nullptr;
+        std::atomic<bool>* done = nullptr;
         void gatherData() override {
             RKRecordingProcess::gatherData();
             memspread->cancel();
+            done->store(true);
         }
     };
     auto canceller = std::make_shared<Canceller>();
@@ -80,6 +90,7 @@ TEST(RKGather, ACancelDuringGatheringSkipsTheProcessesNotYetStarted) {
     all.push_back(canceller);
     RKMemspread memspread(all);
     canceller->memspread = &memspread;
+    canceller->done = &cancelled;
     EXPECT_TRUE(memspread.gatherData());
     EXPECT_EQ(canceller->gathered, 1);
     int gathered = 0;
