@@ -3,6 +3,8 @@
 # For each load: build it (bench/scale-load.c), then run in turn, REPS times round:
 #   floor1  bench/smaps-floor.c, 1 thread: reads every /proc/PID/smaps whole, nothing else
 #   floor2  the same with 2 threads
+#   floorm  floor2 and the pagemap of the mappings with shared anonymous pages (smaps-floor -m):
+#           the kernel's own cost of the page data the fork-shared pass reads
 #   memspread  `memspread -a -j FILE` (text to a file too), page data and fork-shared pass
 # and print the median wall time and peak resident memory (/usr/bin/time's maxrss) of each,
 # with memspread's ratios to the floors. Ratios are what to compare: the machine may be shared.
@@ -102,14 +104,14 @@ median() {  # FILE COLUMN
 
 printf '%s, %s CPUs, load average %s, memspread %s, %s runs each (medians)\n' "$(date -u '+%F %T UTC')" \
     "$(nproc)" "$(cut -d' ' -f1-3 /proc/loadavg)" "${binaries[*]}" "$reps"
-printf '%-3s %-14s %9s %9s | %8s %8s %8s | %8s %8s | %9s %9s %9s\n' bin load processes mappings \
-    floor1_s floor2_s mspread_s /floor1 /floor2 floor_MiB mspr_MiB B/region
+printf '%-3s %-14s %9s %9s | %8s %8s %8s %8s | %8s %8s %8s | %9s %9s %9s\n' bin load processes mappings \
+    floor1_s floor2_s floorm_s mspread_s /floor1 /floor2 /floorm floor_MiB mspr_MiB B/region
 
 for load in "${loads[@]}"; do
     IFS=: read -r children mappings mib <<< "$load"
     start_load "$children" "$mappings" "$mib"
     parent=$(awk '/^ready/ {print $2}' "$work/ready")
-    rm -f "$work"/floor1 "$work"/floor2 "$work"/memspread*
+    rm -f "$work"/floor1 "$work"/floor2 "$work"/floorm "$work"/memspread*
     if ((children == 0)); then
         targets=("$parent")
         selection=(-p "$parent")
@@ -134,6 +136,7 @@ for load in "${loads[@]}"; do
     for ((i = 0; i < reps; i++)); do
         timed floor1 "$work/smaps-floor" 1 "${targets[@]}"
         timed floor2 "$work/smaps-floor" 2 "${targets[@]}"
+        timed floorm "$work/smaps-floor" -m 2 "${targets[@]}"
         for row in "${rows[@]}"; do
             label=${row%%:*}
             timed "memspread$label" env MEMSPREAD_FORK_SHARING="${row#*:}" \
@@ -146,15 +149,16 @@ for load in "${loads[@]}"; do
 
     f1=$(median "$work/floor1" 1)
     f2=$(median "$work/floor2" 1)
+    fm=$(median "$work/floorm" 1)
     frss=$(median "$work/floor2" 2)
     for row in "${rows[@]}"; do
         b=${row%%:*}
         m=$(median "$work/memspread$b" 1)
         mrss=$(median "$work/memspread$b" 2)
-        awk -v b="$b" -v load="$load" -v p="$processes" -v r="$regions" -v f1="$f1" -v f2="$f2" -v m="$m" \
-            -v frss="$frss" -v mrss="$mrss" 'BEGIN {
-            printf "%-3s %-14s %9d %9d | %8.2f %8.2f %8.2f | %8.2f %8.2f | %9.1f %9.1f %9.0f\n",
-                b, load, p, r, f1, f2, m, (f1 > 0 ? m / f1 : 0), (f2 > 0 ? m / f2 : 0),
+        awk -v b="$b" -v load="$load" -v p="$processes" -v r="$regions" -v f1="$f1" -v f2="$f2" -v fm="$fm" \
+            -v m="$m" -v frss="$frss" -v mrss="$mrss" 'BEGIN {
+            printf "%-3s %-14s %9d %9d | %8.2f %8.2f %8.2f %8.2f | %8.2f %8.2f %8.2f | %9.1f %9.1f %9.0f\n",
+                b, load, p, r, f1, f2, fm, m, (f1 > 0 ? m / f1 : 0), (f2 > 0 ? m / f2 : 0), (fm > 0 ? m / fm : 0),
                 frss / 1024, mrss / 1024, mrss * 1024 / r }'
     done
 done
