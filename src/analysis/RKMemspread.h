@@ -9,6 +9,7 @@
 #include <atomic>
 #include <cstdint>
 #include <functional>
+#include <future>
 #include <memory>
 #include <vector>
 
@@ -17,6 +18,8 @@
 #include "output/RKOutputFormatter.h"
 #include "process/RKAnalysisSettings.h"
 #include "process/RKProcess.h"
+
+struct RKSystemMemory;
 
 // Quality-of-service classes of the gathering threads (their niceness on Linux).
 inline constexpr uint32_t QOS_CLASS_USER_INITIATED = 0x19;
@@ -127,7 +130,9 @@ private:
     void _printReportedProcess(const std::shared_ptr<RKProcess>& process, const RKProcessToGroupsMap& groups,
                                bool summarize, ReportState& report);
     void _printProcessHeader(RKProcess& process, bool hasErrors);
-    void _addSystemMemory(ReportState& report) const;
+    struct ReportTotals;
+    std::future<ReportTotals> _startReportTotals(bool summarize) const;
+    static void _addSystemMemory(const RKSystemMemory& system, ReportState& report);
     void _computePrivateGroupCategories(const RKProcessList& reported, const RKProcessToGroupsMap& groups,
                                         bool summarize);
     void _printProcessGroups(RKProcess& process, const RKProcessGroupList* groups, bool summarize);

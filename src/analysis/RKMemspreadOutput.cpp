@@ -2,6 +2,8 @@
 // were added, the formatter loop being the innermost loop.
 #include "analysis/RKMemspread.h"
 
+#include <algorithm>
+#include <future>
 #include <unordered_map>
 #include <utility>
 #include <vector>
@@ -53,6 +55,12 @@ struct RKMemspread::ReportState {
     std::shared_ptr<RKAuxDataMap> globalAuxData;  // of the processes without errors
 };
 
+// What the end of the report needs of every object at once.
+struct RKMemspread::ReportTotals {
+    RKCategoryMap summary;
+    RKSystemMemory system;
+};
+
 void RKMemspread::printOutputVerbose(bool verbose, bool summarize) {
     const RKProcessList reported = _processesBySortingMemspread(_notHiddenProcesses());
     for (const auto& formatter : outputFormatters_) {
@@ -60,13 +68,23 @@ void RKMemspread::printOutputVerbose(bool verbose, bool summarize) {
     }
     if (verbose) printSpanlistLikeOutputForProcesses(reported);
 
+    // The summary's categories and the system's memory only read the objects and regions: they
+    // are found on a thread of their own while the groups are found and the processes reported.
+    // Objects that only hidden processes map are released at the end of the groups walk: with
+    // hidden processes, that thread starts after it.
+    std::future<ReportTotals> totals;
+    const bool anyHidden = std::any_of(processes_.begin(), processes_.end(),
+                                       [](const auto& process) { return process->hiddenFromDisplay(); });
+    if (!anyHidden) totals = _startReportTotals(summarize);
     // From here on the groups, categories and views hold the memory objects.
     RKProcessToGroupsMap groups = _generateProcessToProcessGroups();
+    if (anyHidden) totals = _startReportTotals(summarize);
 
     _computePrivateGroupCategories(reported, groups, summarize);
     ReportState report;
     for (const auto& process : reported) _printReportedProcess(process, groups, summarize, report);
-    if (measuresWholeSystem_) _addSystemMemory(report);
+    const ReportTotals found = totals.get();
+    if (measuresWholeSystem_) _addSystemMemory(found.system, report);
     // Processes that could not be opened are never shown, but the run names them.
     for (const auto& process : processes_) {
         if (dynamic_cast<const RKUnreadProcess*>(process.get())) report.withWarnings.push_back(process);
@@ -77,7 +95,7 @@ void RKMemspread::printOutputVerbose(bool verbose, bool summarize) {
         formatter->printProcessesWithWarnings(report.withWarnings, report.withErrors, report.globalErrors);
     }
 
-    const RKCategoryMap summary = _categoriesForAllProcessesShouldSummarize(summarize);
+    const RKCategoryMap& summary = found.summary;
     RKMemoryTotal summaryTotal;
     _totalForCategories(summary, &summaryTotal);
     const bool hadErrors = !report.globalErrors.empty() || !report.withErrors.empty();
@@ -116,8 +134,17 @@ void RKMemspread::_computePrivateGroupCategories(const RKProcessList& reported, 
     });
 }
 
-void RKMemspread::_addSystemMemory(ReportState& report) const {
-    RKSystemMemory system = RKAccountForSystemMemory(processes_, breakDownPhysMemspread());
+std::future<RKMemspread::ReportTotals> RKMemspread::_startReportTotals(bool summarize) const {
+    const bool breakDown = breakDownPhysMemspread();  // read here: the setting is cached on first read
+    // Deferred to get() where no thread can be started.
+    return std::async(std::launch::async | std::launch::deferred, [this, summarize, breakDown] {
+        ReportTotals totals{_categoriesForAllProcessesShouldSummarize(summarize), {}};
+        if (measuresWholeSystem_) totals.system = RKAccountForSystemMemory(processes_, breakDown);
+        return totals;
+    });
+}
+
+void RKMemspread::_addSystemMemory(const RKSystemMemory& system, ReportState& report) {
     if (!system.map) return;
     if (!report.globalAuxData) report.globalAuxData = std::make_shared<RKAuxDataMap>();
     report.globalAuxData->setObject("system", system.map);
