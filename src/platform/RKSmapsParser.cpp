@@ -1,6 +1,9 @@
 #include "platform/RKSmapsParser.h"
 
+#include <array>
+#include <bit>
 #include <charconv>
+#include <cstring>
 
 namespace {
 
@@ -134,12 +137,117 @@ void parseField(std::string_view line, RKSmapsVma& vma) {
     }
 }
 
+// The kernel prints a kB field as its name and colon padded to 16 columns, the value right-aligned
+// in 8, and " kB": 28 bytes with the newline while the value fits. Nearly every line of smaps is
+// such a line. They are taken by position: the 16 columns before the value compared as two words
+// with those of the fields read (no search for the colon or the newline, and no branch that
+// depends on which field it is), the 8 columns of the value converted as one word.
+constexpr size_t kFixedLineLength = 28;
+constexpr size_t kValueColumn = 16;
+constexpr size_t kUnitColumn = 24;
+
+struct FixedField {
+    uint64_t head = 0, tail = 0;  // columns 0-7 and 8-15, first column in the low byte
+    uint64_t RKSmapsVma::*member = nullptr;
+};
+
+constexpr FixedField fixedField(std::string_view name, uint64_t RKSmapsVma::*member) {
+    FixedField field{0, 0, member};
+    for (size_t i = 0; i < kValueColumn; i++) {
+        const char c = i < name.size() ? name[i] : i == name.size() ? ':' : ' ';
+        (i < 8 ? field.head : field.tail) |= uint64_t{static_cast<unsigned char>(c)} << (8 * (i % 8));
+    }
+    return field;
+}
+
+// The fields of fieldFor that fit the layout (names of 15 characters or fewer).
+constexpr FixedField kFixedFields[] = {
+    fixedField("Rss", &RKSmapsVma::rss),
+    fixedField("Swap", &RKSmapsVma::swap),
+    fixedField("LazyFree", &RKSmapsVma::lazyFree),
+    fixedField("Anonymous", &RKSmapsVma::anonymous),
+    fixedField("Shared_Clean", &RKSmapsVma::sharedClean),
+    fixedField("Shared_Dirty", &RKSmapsVma::sharedDirty),
+    fixedField("Private_Clean", &RKSmapsVma::privateClean),
+    fixedField("Private_Dirty", &RKSmapsVma::privateDirty),
+    fixedField("Shared_Hugetlb", &RKSmapsVma::sharedHugetlb),
+    fixedField("Private_Hugetlb", &RKSmapsVma::privateHugetlb),
+};
+
+// Those fields by a hash of their columns, each in a slot of its own: a line is one lookup and
+// one comparison.
+constexpr size_t kFixedSlotBits = 5;
+
+constexpr size_t fixedSlot(uint64_t head, uint64_t tail) {
+    return static_cast<size_t>(((head ^ (tail * 7)) * 0x9E3779B97F4A7C15ull) >> (64 - kFixedSlotBits));
+}
+
+constexpr std::array<FixedField, size_t{1} << kFixedSlotBits> kFixedSlots = [] {
+    std::array<FixedField, size_t{1} << kFixedSlotBits> slots{};
+    for (const FixedField& field : kFixedFields) slots[fixedSlot(field.head, field.tail)] = field;
+    return slots;
+}();
+
+constexpr bool eachFixedFieldInItsOwnSlot() {
+    for (const FixedField& field : kFixedFields)
+        if (kFixedSlots[fixedSlot(field.head, field.tail)].member != field.member) return false;
+    return true;
+}
+static_assert(eachFixedFieldInItsOwnSlot(), "two fields share a slot: change the hash");
+
+uint64_t loadWord(const char* at) {
+    uint64_t word;
+    std::memcpy(&word, at, sizeof word);
+    return word;
+}
+
+bool isFixedKbLine(std::string_view text) {
+    return std::endian::native == std::endian::little && text.size() >= kFixedLineLength &&
+           text[kFixedLineLength - 1] == '\n' && text.compare(kUnitColumn, 3, " kB") == 0 &&
+           !isHeaderStart(text.front());
+}
+
+// The 8 columns of a value: spaces, then digits to the last column. False for anything else.
+bool fixedValue(uint64_t columns, uint64_t& value) {
+    constexpr uint64_t kOnes = 0x0101010101010101;
+    const uint64_t spacesZeroed = columns ^ (0x20 * kOnes);
+    // The high bit of each column that is not a space.
+    const uint64_t nonSpace = (((spacesZeroed & (0x7F * kOnes)) + 0x7F * kOnes) | spacesZeroed) & (0x80 * kOnes);
+    if (nonSpace == 0) return false;
+    // From the first column that is not a space on, the columns as they are; before it, '0'.
+    const uint64_t number = ~uint64_t{0} << (std::countr_zero(nonSpace) - 7);
+    const uint64_t digits = (columns & number) | ((0x30 * kOnes) & ~number);
+    if ((digits & (0xF0 * kOnes)) != 0x30 * kOnes || ((digits + 0x06 * kOnes) & (0xF0 * kOnes)) != 0x30 * kOnes)
+        return false;
+    // Eight digits, the first in the low byte, as one number (pairs, then fours, then all).
+    uint64_t v = digits - 0x30 * kOnes;
+    v = v * 10 + (v >> 8);
+    v = ((v & 0x000000FF000000FF) * (100 + (1000000ull << 32)) +
+         ((v >> 16) & 0x000000FF000000FF) * (1 + (10000ull << 32))) >> 32;
+    value = v;
+    return true;
+}
+
+// A fixed kB line at the front of `text` (isFixedKbLine), into its field of `vma` if it is one.
+void parseFixedKbLine(std::string_view text, RKSmapsVma& vma) {
+    const uint64_t head = loadWord(text.data()), tail = loadWord(text.data() + 8);
+    const FixedField& field = kFixedSlots[fixedSlot(head, tail)];
+    uint64_t kB = 0;
+    if (field.member && field.head == head && field.tail == tail && fixedValue(loadWord(text.data() + kValueColumn), kB))
+        vma.*field.member = kB;
+}
+
 }  // namespace
 
 RKSmapsParseResult RKParseSmaps(std::string_view text, std::vector<RKSmapsVma>& vmas) {
     RKSmapsParseResult result;
     RKSmapsVma* current = nullptr;
     while (!text.empty()) {
+        if (current && isFixedKbLine(text)) {
+            parseFixedKbLine(text, *current);
+            text.remove_prefix(kFixedLineLength);
+            continue;
+        }
         size_t newline = text.find('\n');
         std::string_view line = text.substr(0, newline);
         text.remove_prefix(newline == std::string_view::npos ? text.size() : newline + 1);

@@ -133,6 +133,33 @@ TEST_F(RKSmapsTest, ParsingSkipsWhatItCannotReadWithoutLosingItsNeighbours) {
     EXPECT_EQ(cut.back().vmFlags, 0u);
 }
 
+// Values that fill their 8 columns and values wider than them (a line longer than usual) read
+// alike; a field that is not read, or a value that is not a number, changes nothing.
+TEST(RKSmapsParser, ValuesOfEveryWidthReadAlike) {
+    const std::string text =
+        "7f0000000000-7f0000001000 rw-p 00000000 00:00 0 \n"
+        "KernelPageSize: 12345678 kB\n"
+        "Rss:            99999999 kB\n"
+        "Shared_Dirty:   123456789 kB\n"
+        "Private_Dirty:  123456789012 kB\n"
+        "Swap:                  0 kB\n"
+        "Shared_Clean:        4 2 kB\n"
+        "LazyFree:                kB\n"
+        "Anonymous:             7 kB\n"
+        "VmFlags: rd wr mr mw me ac \n";
+    std::vector<RKSmapsVma> vmas;
+    RKParseSmaps(text, vmas);
+    ASSERT_EQ(vmas.size(), 1u);
+    EXPECT_EQ(vmas[0].rss, 99999999u);
+    EXPECT_EQ(vmas[0].sharedDirty, 123456789u);
+    EXPECT_EQ(vmas[0].privateDirty, 123456789012u);
+    EXPECT_EQ(vmas[0].swap, 0u);
+    EXPECT_EQ(vmas[0].sharedClean, 0u);
+    EXPECT_EQ(vmas[0].lazyFree, 0u);
+    EXPECT_EQ(vmas[0].anonymous, 7u);
+    EXPECT_EQ(vmas[0].vmFlags, RKVmMayRead | RKVmMayWrite | RKVmMayExec);
+}
+
 // A memfd mapped privately and writable reaches the object's pages until written through; its
 // copies then make it the process's own. (That its pages are memory, not clean page cache, the
 // table above and RKOwnedMemoryFixture show.)
