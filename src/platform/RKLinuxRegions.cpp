@@ -10,11 +10,22 @@ namespace {
 
 RKLinuxTask* linuxTask(RKTask& task) { return dynamic_cast<RKLinuxTask*>(&task); }
 
-// The first region ending above `address`, or nullptr.
+// The first region ending above `address`, or nullptr. The region found last, or the one after
+// it, is the answer of nearly every lookup of a walk; others are searched for.
 const RKLinuxRegion* regionEndingAbove(const RKLinuxWalkSnapshot& snapshot, uint64_t address) {
-    auto it = std::upper_bound(snapshot.regions.begin(), snapshot.regions.end(), address,
-                               [](uint64_t a, const RKLinuxRegion& r) { return a < r.vma.end; });
-    return it == snapshot.regions.end() ? nullptr : &*it;
+    const auto& regions = snapshot.regions;
+    auto isAnswer = [&](size_t i) {
+        return i < regions.size() && address < regions[i].vma.end && (i == 0 || regions[i - 1].vma.end <= address);
+    };
+    size_t found = snapshot.lastFound;
+    if (!isAnswer(found) && !isAnswer(++found)) {
+        auto it = std::upper_bound(regions.begin(), regions.end(), address,
+                                   [](uint64_t a, const RKLinuxRegion& r) { return a < r.vma.end; });
+        found = static_cast<size_t>(it - regions.begin());
+    }
+    if (found == regions.size()) return nullptr;
+    snapshot.lastFound = found;
+    return &regions[found];
 }
 
 const RKLinuxRegion* regionContaining(const RKLinuxWalkSnapshot& snapshot, uint64_t address) {

@@ -36,6 +36,9 @@ struct RKLinuxWalkSnapshot {
     // Read for the image lister just before a walk: the walk that starts next uses it instead
     // of reading smaps again.
     bool readyForWalk = false;
+    // Where the last lookup by address found its region: a walk asks in ascending order, mostly
+    // for that region or the next.
+    mutable size_t lastFound = 0;
 };
 
 class RKLinuxTask : public RKTask {

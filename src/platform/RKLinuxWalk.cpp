@@ -221,6 +221,7 @@ void RKRecycleWalkSnapshot(std::unique_ptr<RKLinuxWalkSnapshot> snapshot) {
         return;
     if (tSpareSnapshot && tSpareSnapshot->text.capacity() >= snapshot->text.capacity()) return;
     snapshot->regions.clear();
+    snapshot->lastFound = 0;
     snapshot->end = KERN_INVALID_ADDRESS;
     snapshot->readyForWalk = false;
     tSpareSnapshot = std::move(snapshot);

@@ -12,6 +12,7 @@
 #include <unordered_set>
 #include <vector>
 
+#include "model/RKInternedString.h"
 #include "platform/RKPlatform.h"
 #include "platform/RKSharedPageList.h"
 #include "process/RKProcess.h"
@@ -67,6 +68,10 @@ struct RKRegionWalkState {
     // (RKUserProcessSharedAnonymous.cpp).
     std::vector<std::shared_ptr<RKMemoryRegion>> sharedAnonymousRegions;
     std::vector<RKPageQueryRange> sharedAnonymousRanges;
+    // The name of the tag named last: a process's anonymous regions mostly share a tag, and
+    // interning the name anew for each would take the intern table's lock every time.
+    uint32_t lastNamedTag = UINT32_MAX;
+    RKInternedString lastTagName;
 };
 
 // Architectures that decide where the shared library cache is mapped.

@@ -273,7 +273,11 @@ void RKUserProcess::_nameRegion(RKMemoryRegion& region, const RKRegionSubmapInfo
         region.name = "GPU Carveout (reserved)";
         region.verbose = true;
     } else {
-        region.name = RKMemoryRegion::categoryNameForTag(region.user_tag);
+        if (region.user_tag != state.lastNamedTag) {
+            state.lastTagName = RKMemoryRegion::categoryNameForTag(region.user_tag);
+            state.lastNamedTag = region.user_tag;
+        }
+        region.name = state.lastTagName;
         // The platform names what tells regions of one tag apart (a memfd's name, a tmpfs
         // path); as the detail it keeps them apart in the report.
         if (_isAlive() && task_) region.detailedName = RKPlatform::current().regionFileName(*task_, region.start).value_or("");
