@@ -237,7 +237,7 @@ uint64_t RKMemspread::_calculateMemspreadForProcess(const RKProcess& process) co
     if (breakDownPhysMemspread()) {
         for (const auto& region : regions) {
             // Memory another process owns is that process's, as the views show it.
-            std::shared_ptr<RKMemoryObject> object = region->memoryObject();
+            const RKMemoryObject* object = region->memoryObjectPointer();
             if (object && object->ownerPid() != -1 && object->ownerPid() != process.pid()) continue;
             memspread += region->dirtySize + region->swappedSize;
         }
@@ -246,7 +246,7 @@ uint64_t RKMemspread::_calculateMemspreadForProcess(const RKProcess& process) co
     // Every process that maps an object is charged its whole dirty and swapped bytes, once.
     RKPointerSet counted;
     for (const auto& region : regions) {
-        std::shared_ptr<RKMemoryObject> object = region->memoryObject();
+        const RKMemoryObject* object = region->memoryObjectPointer();
         if (!object || !RKFirstMeeting(counted, *object)) continue;
         memspread += object->totalDirtySize() + object->totalSwappedSize();
     }
@@ -305,9 +305,9 @@ RKCategoryMap RKMemspread::_categoriesForAllProcessesShouldSummarize(bool summar
     for (const auto& process : processes_) {
         if (process->hiddenFromDisplay() || !process->memoryRegions()) continue;
         for (const auto& region : *process->memoryRegions()) {
-            std::shared_ptr<RKMemoryObject> object = region->memoryObject();
+            RKMemoryObject* object = region->memoryObjectPointer();
             if (!object || !RKFirstMeeting(seen, *object)) continue;
-            categoryFor(*object).addMemoryObject(object);
+            categoryFor(*object).addMemoryObject(*object);
         }
     }
     return categories;

@@ -38,7 +38,7 @@ RKSystemMemory RKAccountForSystemMemory(const RKProcessList& processes, bool bre
             continue;
         }
         for (const auto& region : *process->memoryRegions()) {
-            std::shared_ptr<RKMemoryObject> object = region->memoryObject();
+            const RKMemoryObject* object = region->memoryObjectPointer();
             if (!object || !RKFirstMeeting(seen, *object)) continue;
             userMemory += static_cast<int64_t>(object->totalDirtySize() + object->totalReclaimableSize() +
                                                object->totalCleanSize());

@@ -18,6 +18,8 @@ public:
     // Adds the object's five totals and its number of regions; the first object names the
     // category. A view built from one process's regions counts only those regions.
     void addMemoryObject(const std::shared_ptr<RKMemoryObject>& object);
+    // The same for an object the caller holds no reference to: only the first is taken one of.
+    void addMemoryObject(RKMemoryObject& object);
 
     bool isSummary() const { return isSummary_; }
     // Names of the first object; empty when nothing was added. A summary has no detail.
