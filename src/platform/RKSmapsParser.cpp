@@ -86,38 +86,29 @@ uint32_t parseVmFlags(std::string_view s) {
     return flags;
 }
 
+// The kB fields memspread reads.
+struct KbField {
+    std::string_view name;
+    uint64_t RKSmapsVma::*member;
+};
+
+constexpr KbField kKbFields[] = {
+    {"Rss", &RKSmapsVma::rss},
+    {"Swap", &RKSmapsVma::swap},
+    {"LazyFree", &RKSmapsVma::lazyFree},
+    {"Anonymous", &RKSmapsVma::anonymous},
+    {"Shared_Clean", &RKSmapsVma::sharedClean},
+    {"Shared_Dirty", &RKSmapsVma::sharedDirty},
+    {"Private_Clean", &RKSmapsVma::privateClean},
+    {"Private_Dirty", &RKSmapsVma::privateDirty},
+    {"Shared_Hugetlb", &RKSmapsVma::sharedHugetlb},
+    {"Private_Hugetlb", &RKSmapsVma::privateHugetlb},
+};
+
 // The kB field called `name`, or nullptr for a field memspread does not read.
 uint64_t* fieldFor(std::string_view name, RKSmapsVma& vma) {
-    switch (name.size()) {
-        case 3:
-            if (name == "Rss") return &vma.rss;
-            break;
-        case 4:
-            if (name == "Swap") return &vma.swap;
-            break;
-        case 8:
-            if (name == "LazyFree") return &vma.lazyFree;
-            break;
-        case 9:
-            if (name == "Anonymous") return &vma.anonymous;
-            break;
-        case 12:
-            if (name == "Shared_Clean") return &vma.sharedClean;
-            if (name == "Shared_Dirty") return &vma.sharedDirty;
-            break;
-        case 13:
-            if (name == "Private_Clean") return &vma.privateClean;
-            if (name == "Private_Dirty") return &vma.privateDirty;
-            break;
-        case 14:
-            if (name == "Shared_Hugetlb") return &vma.sharedHugetlb;
-            break;
-        case 15:
-            if (name == "Private_Hugetlb") return &vma.privateHugetlb;
-            break;
-        default:
-            break;
-    }
+    for (const KbField& field : kKbFields)
+        if (field.name == name) return &(vma.*field.member);
     return nullptr;
 }
 
@@ -139,9 +130,9 @@ void parseField(std::string_view line, RKSmapsVma& vma) {
 
 // The kernel prints a kB field as its name and colon padded to 16 columns, the value right-aligned
 // in 8, and " kB": 28 bytes with the newline while the value fits. Nearly every line of smaps is
-// such a line. They are taken by position: the 16 columns before the value compared as two words
-// with those of the fields read (no search for the colon or the newline, and no branch that
-// depends on which field it is), the 8 columns of the value converted as one word.
+// such a line. They are taken by position, with no search for the colon or the newline: the 16
+// columns before the value, as two words, find the field read in a table, the 8 columns of the
+// value convert as one word.
 constexpr size_t kFixedLineLength = 28;
 constexpr size_t kValueColumn = 16;
 constexpr size_t kUnitColumn = 24;
@@ -151,31 +142,17 @@ struct FixedField {
     uint64_t RKSmapsVma::*member = nullptr;
 };
 
-constexpr FixedField fixedField(std::string_view name, uint64_t RKSmapsVma::*member) {
-    FixedField field{0, 0, member};
+constexpr FixedField fixedField(const KbField& field) {
+    FixedField fixed{0, 0, field.member};
     for (size_t i = 0; i < kValueColumn; i++) {
-        const char c = i < name.size() ? name[i] : i == name.size() ? ':' : ' ';
-        (i < 8 ? field.head : field.tail) |= uint64_t{static_cast<unsigned char>(c)} << (8 * (i % 8));
+        const char c = i < field.name.size() ? field.name[i] : i == field.name.size() ? ':' : ' ';
+        (i < 8 ? fixed.head : fixed.tail) |= uint64_t{static_cast<unsigned char>(c)} << (8 * (i % 8));
     }
-    return field;
+    return fixed;
 }
 
-// The fields of fieldFor that fit the layout (names of 15 characters or fewer).
-constexpr FixedField kFixedFields[] = {
-    fixedField("Rss", &RKSmapsVma::rss),
-    fixedField("Swap", &RKSmapsVma::swap),
-    fixedField("LazyFree", &RKSmapsVma::lazyFree),
-    fixedField("Anonymous", &RKSmapsVma::anonymous),
-    fixedField("Shared_Clean", &RKSmapsVma::sharedClean),
-    fixedField("Shared_Dirty", &RKSmapsVma::sharedDirty),
-    fixedField("Private_Clean", &RKSmapsVma::privateClean),
-    fixedField("Private_Dirty", &RKSmapsVma::privateDirty),
-    fixedField("Shared_Hugetlb", &RKSmapsVma::sharedHugetlb),
-    fixedField("Private_Hugetlb", &RKSmapsVma::privateHugetlb),
-};
-
-// Those fields by a hash of their columns, each in a slot of its own: a line is one lookup and
-// one comparison.
+// The fields read, by a hash of their columns, each in a slot of its own: a line is one lookup
+// and one comparison.
 constexpr size_t kFixedSlotBits = 5;
 
 constexpr size_t fixedSlot(uint64_t head, uint64_t tail) {
@@ -184,16 +161,23 @@ constexpr size_t fixedSlot(uint64_t head, uint64_t tail) {
 
 constexpr std::array<FixedField, size_t{1} << kFixedSlotBits> kFixedSlots = [] {
     std::array<FixedField, size_t{1} << kFixedSlotBits> slots{};
-    for (const FixedField& field : kFixedFields) slots[fixedSlot(field.head, field.tail)] = field;
+    for (const KbField& field : kKbFields) {
+        const FixedField fixed = fixedField(field);
+        slots[fixedSlot(fixed.head, fixed.tail)] = fixed;
+    }
     return slots;
 }();
 
-constexpr bool eachFixedFieldInItsOwnSlot() {
-    for (const FixedField& field : kFixedFields)
-        if (kFixedSlots[fixedSlot(field.head, field.tail)].member != field.member) return false;
+// Every field read has a name that leaves room for its colon, and a slot of its own.
+constexpr bool eachFieldFitsAndHasItsSlot() {
+    for (const KbField& field : kKbFields) {
+        const FixedField fixed = fixedField(field);
+        if (field.name.size() >= kValueColumn || kFixedSlots[fixedSlot(fixed.head, fixed.tail)].member != field.member)
+            return false;
+    }
     return true;
 }
-static_assert(eachFixedFieldInItsOwnSlot(), "two fields share a slot: change the hash");
+static_assert(eachFieldFitsAndHasItsSlot(), "a field's name is too long, or two fields share a slot: change the hash");
 
 uint64_t loadWord(const char* at) {
     uint64_t word;
