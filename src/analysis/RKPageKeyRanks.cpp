@@ -73,7 +73,10 @@ void RKPageKeyRanks::seal() {
 
 // Called for every page of every process: where the processor counts bits in one instruction
 // (nearly every x86-64 processor made since 2008), that instruction, not a library routine.
-#if defined(__x86_64__) && defined(__GNUC__) && !defined(__clang__)
+// Not under the sanitizers: the clone is chosen while the program is being loaded, before their
+// runtime is ready (ThreadSanitizer's builds crashed there).
+#if defined(__x86_64__) && defined(__GNUC__) && !defined(__clang__) && !defined(__SANITIZE_THREAD__) && \
+    !defined(__SANITIZE_ADDRESS__)
 __attribute__((target_clones("popcnt", "default")))
 #endif
 uint32_t RKPageKeyRanks::rankFrom(uint64_t key, Cursor& cursor) const {
