@@ -157,19 +157,12 @@ bool RKPreadAll(int fd, void* buffer, size_t bytes, uint64_t offset) {
 }
 
 const RKLinuxPageProbe& RKProbePageReading(const std::string& procRoot) {
-    // Asked about for every region: each thread keeps its last answer (entries stay where they
-    // are), and takes the lock only for another root.
-    thread_local const std::string* lastRoot = nullptr;
-    thread_local const RKLinuxPageProbe* last = nullptr;
-    if (last && *lastRoot == procRoot) return *last;
     static std::mutex mutex;
     static std::map<std::string, RKLinuxPageProbe> probes;
     std::lock_guard lock(mutex);
     auto it = probes.find(procRoot);
     if (it == probes.end()) it = probes.emplace(procRoot, probe(procRoot)).first;
-    lastRoot = &it->first;
-    last = &it->second;
-    return *last;
+    return it->second;
 }
 
 kern_return_t RKScanPresentPages(int pagemap, uint64_t start, uint64_t end, std::vector<RKPageScanRun>& runs) {

@@ -66,7 +66,17 @@ RKPageSpan RKLinuxPlatform::pageQueryPopulated(RKTask& task, uint64_t address, u
     return span;
 }
 
+const RKLinuxPageProbe& RKLinuxPlatform::pageProbe() {
+    // The probes of a root are kept for the program's life: the pointer stays good.
+    const RKLinuxPageProbe* probe = pageProbe_.load(std::memory_order_acquire);
+    if (!probe) {
+        probe = &RKProbePageReading(procRoot());
+        pageProbe_.store(probe, std::memory_order_release);
+    }
+    return *probe;
+}
+
 RKPageQueryAbilities RKLinuxPlatform::pageQueryAbilities() {
-    const RKLinuxPageProbe& probe = RKProbePageReading(procRoot());
+    const RKLinuxPageProbe& probe = pageProbe();
     return RKPageQueryAbilities{probe.kpageflags, probe.kpageflags};
 }

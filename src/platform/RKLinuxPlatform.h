@@ -2,10 +2,13 @@
 // The roots are injectable so the readers can be tested on small fake trees.
 #pragma once
 
+#include <atomic>
 #include <memory>
 #include <string>
 
 #include "platform/RKPlatform.h"
+
+struct RKLinuxPageProbe;
 
 class RKFrameVerdictsOfGather;
 class RKSysVTableOfGather;
@@ -74,8 +77,12 @@ public:
     pid_t ownPid() override;
 
 private:
+    // What this root's kernel lets pages be read with: asked for every region, probed once.
+    const RKLinuxPageProbe& pageProbe();
+
     std::string procRoot_;
     std::string sysRoot_;
+    std::atomic<const RKLinuxPageProbe*> pageProbe_{nullptr};
     std::shared_ptr<RKSysVTableOfGather> sysV_;  // read once a gather (RKLinuxOwnedObjects.cpp)
     std::shared_ptr<RKFrameVerdictsOfGather> frameVerdicts_;  // read once a gather
 };

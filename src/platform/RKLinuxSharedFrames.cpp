@@ -132,14 +132,14 @@ kern_return_t RKLinuxPlatform::sharedAnonymousPages(RKTask& task, const std::vec
     sharedBytes = 0;
     auto* target = dynamic_cast<RKLinuxTask*>(&task);
     if (!target) return KERN_INVALID_ARGUMENT;
-    if (!RKProbePageReading(procRoot()).kpageflags) {
+    if (!pageProbe().kpageflags) {
         sharedBytes = sharedAnonymousBytes(task, ranges);
         return KERN_NOT_SUPPORTED;
     }
     RKUniqueFd pagemap(::openat(target->directoryFd(), "pagemap", O_RDONLY | O_CLOEXEC));
     if (!pagemap.valid()) return errno == EACCES || errno == EPERM ? KERN_PROTECTION_FAILURE : KERN_INVALID_ARGUMENT;
     kern_return_t result = CandidateReader(pagemap.get(), kernelPageSize(), ranges, pages)
-                               .read(RKProbePageReading(procRoot()).pagemapScan);
+                               .read(pageProbe().pagemapScan);
     if (result != KERN_SUCCESS) return result;
     // Swapped pages, rare, sorted apart: their keys would need six passes of the radix sort.
     auto swapped = std::stable_partition(pages.begin(), pages.end(), [](const auto& p) { return !p.swapped(); });
